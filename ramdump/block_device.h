@@ -1,0 +1,12 @@
+// Finds the block device that holds a file, from the device's mount table.
+#pragma once
+
+#include "fs_mgr/fs_mgr_fstab.h"
+
+// path must be absolute with links and dot components resolved. Returns the mount_source of
+// the first record whose mount point is a prefix of path followed by "/" or the end of path
+// (borrowed from table), or null. On a match *encryptable is 1 when the record may be
+// encrypted, and *encrypted is 1 when it may be and "ro.crypto.state" reads "encrypted";
+// without a match both are left untouched.
+const char* find_block_device(const char* path, const fstab* table, int* encryptable,
+                              int* encrypted);

@@ -1,0 +1,38 @@
+#include "ramdump/retry_io.h"
+
+#include <errno.h>
+#include <string.h>
+#include <unistd.h>
+
+#include "platform/log.h"
+
+int read_retry(int fd, void* buf, size_t length) {
+  char* p = static_cast<char*>(buf);
+  while (length > 0) {
+    ssize_t n = read(fd, p, length);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      RB_LOGE("error reading: %s\n", strerror(errno));
+      return -1;
+    }
+    if (n == 0) break;
+    p += n;
+    length -= static_cast<size_t>(n);
+  }
+  return 0;
+}
+
+int write_retry(int fd, const void* buf, size_t length) {
+  const char* p = static_cast<const char*>(buf);
+  while (length > 0) {
+    ssize_t n = write(fd, p, length);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      RB_LOGE("error writing: %s\n", strerror(errno));
+      return -1;
+    }
+    p += n;
+    length -= static_cast<size_t>(n);
+  }
+  return 0;
+}
