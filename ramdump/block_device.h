@@ -10,3 +10,9 @@
 // without a match both are left untouched.
 const char* find_block_device(const char* path, const fstab* table, int* encryptable,
                               int* encrypted);
+
+// Loads the default mount table and finds path's block device in it. Returns 0 with *table
+// (which must stay loaded while *blk_dev is used) and the outputs set, or 1 after logging
+// that the table or the device was not found (a table already loaded is not released).
+int resolve_block_device(const char* path, fstab** table, const char** blk_dev, int* encryptable,
+                         int* encrypted);

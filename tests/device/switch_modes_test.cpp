@@ -30,13 +30,6 @@ const char kUsage[] =
 const char kPrimary[] = "/dev/block/platform/msm_sdcc.1/by-name/misc";
 const char kSecondary[] = "/dev/block/bootdevice/by-name/misc";
 
-#define REQUIRE_DEVICE(device)                                              \
-  do {                                                                      \
-    std::string why;                                                        \
-    if (!fake_device_supported(&why)) GTEST_SKIP() << why;                  \
-    ASSERT_EQ((device).setup_error(), "") << "fake device root not set up"; \
-  } while (0)
-
 // The misc image with the given bytes placed at offset; everything else keeps the fill byte.
 std::string misc_with(const std::string& base, size_t offset, const std::string& bytes) {
   std::string image = base;

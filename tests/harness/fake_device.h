@@ -71,6 +71,12 @@ class FakeDevice {
   RunResult run(const std::vector<std::string>& args, const std::string& program = "reserveblocks",
                 int timeout_seconds = 600);
 
+  // Called with each line a program run by run() writes to standard error, while it runs
+  // (for showing progress live); an empty function turns it off.
+  void set_stderr_listener(std::function<void(const std::string&)> listener) {
+    stderr_listener_ = std::move(listener);
+  }
+
   // Runs fn in a child chrooted into the root; its result is the exit status, its standard
   // output and error are captured.
   RunResult run_in_root(const std::function<int()>& fn, int timeout_seconds = 60);
@@ -107,10 +113,25 @@ class FakeDevice {
   std::vector<std::string> mounts_;  // in mount order
   std::string error_;
   bool torn_down_ = false;
+  std::function<void(const std::string&)> stderr_listener_;
 };
 
 // Whether the harness can run here (root), and why not.
 bool fake_device_supported(std::string* why);
+
+// In a test: skips when the harness cannot run here, fails when the root was not set up.
+#define REQUIRE_DEVICE(device)                                              \
+  do {                                                                      \
+    std::string why_unsupported;                                            \
+    if (!fake_device_supported(&why_unsupported)) {                         \
+      GTEST_SKIP() << why_unsupported;                                      \
+    }                                                                       \
+    ASSERT_EQ((device).setup_error(), "") << "fake device root not set up"; \
+  } while (0)
+
+// Paths of the fake device.
+#define USERDATA_DEVICE "/dev/block/bootdevice/by-name/userdata"
+#define MISC_DEVICE "/dev/block/bootdevice/by-name/misc"
 
 // The build directory holding the programs under test.
 std::string build_dir();
