@@ -36,3 +36,10 @@ int write_retry(int fd, const void* buf, size_t length) {
   }
   return 0;
 }
+
+off64_t seek_retry(int fd, off64_t offset) {
+  off64_t pos;
+  while ((pos = lseek64(fd, offset, SEEK_SET)) < 0 && errno == EINTR) {
+  }
+  return pos;
+}

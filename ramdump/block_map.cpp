@@ -1,0 +1,25 @@
+#include "ramdump/block_map.h"
+
+#include <errno.h>
+#include <linux/fs.h>
+#include <string.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+
+#include "platform/log.h"
+
+static_assert(FIBMAP == 1, "the block-mapping ioctl is request 1");
+
+int stat_block_file(const char* path, int64_t* block_size, uint32_t* count, int64_t* size) {
+  struct stat st;
+  if (stat(path, &st) != 0) {
+    RB_LOGE("failed to stat %s: %s\n", path, strerror(errno));
+    return -1;
+  }
+  *block_size = static_cast<int32_t>(st.st_blksize);
+  *size = st.st_size;
+  *count = static_cast<uint32_t>(*size / *block_size);
+  return 0;
+}
+
+int fibmap(int fd, int* block) { return ioctl(fd, FIBMAP, block); }

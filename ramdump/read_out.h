@@ -1,0 +1,9 @@
+// Read-out: copies the reserved blocks, in chain order, from the raw block device into a
+// file. The device is read, not the file, because the firmware wrote the dump into the
+// physical blocks behind the file system's back.
+#pragma once
+
+// Every block of block_file, mapped to its physical block, read from blk_dev and appended to
+// out_file (created with mode 0666), each block whole with its chain header. Returns 0, or -1
+// after logging the failure; a partly written out file stays.
+int raw_read_blocks(const char* block_file, const char* blk_dev, const char* out_file);
