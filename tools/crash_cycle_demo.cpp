@@ -125,10 +125,21 @@ int main() {
   printf("  mount table: /vendor/etc/fstab.rbtest, hardware name from /proc/cmdline\n");
   printf("  free space on /data: %.2f GiB\n", device.free_space() / 1073741824.0);
 
-  // Progress lines arrive as "done/total"; keep them on one updating line.
-  device.set_stderr_listener([](const std::string& line) {
-    printf("\r  progress %-20s", line.c_str());
-    fflush(stdout);
+  // Progress lines arrive as "done/total": on a terminal they update one line in place,
+  // otherwise every quarter of the way gets a line of its own.
+  const bool terminal = isatty(STDOUT_FILENO);
+  int last_quarter = -1;
+  device.set_stderr_listener([terminal, &last_quarter](const std::string& line) {
+    unsigned long done = 0, total = 0;
+    if (sscanf(line.c_str(), "%lu/%lu", &done, &total) != 2 || total == 0) return;
+    if (terminal) {
+      printf("\r  progress %-20s", line.c_str());
+      fflush(stdout);
+      return;
+    }
+    int quarter = static_cast<int>(done * 4 / total);
+    if (done == 0 || quarter != last_quarter) printf("  progress %s\n", line.c_str());
+    last_quarter = quarter;
   });
 
   bool ok = run_step(device, "Switch the feature on", {"-e"}) &&
