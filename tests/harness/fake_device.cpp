@@ -52,6 +52,10 @@ std::string dirname_of(const std::string& path) {
   return slash == std::string::npos || slash == 0 ? "/" : path.substr(0, slash);
 }
 
+// Starts a program of the root (path inside the root, argv[0] as given); returns only on
+// failure.
+void exec_program(const std::string& path, char** argv) { execv(path.c_str(), argv); }
+
 // Live devices, so that a signal can tear them down before the process dies.
 std::vector<FakeDevice*> live_devices;
 
@@ -152,6 +156,7 @@ uint64_t le64_at(const std::string& b, size_t o) {
 FakeDevice::FakeDevice(const FakeDeviceConfig& config) {
   install_signal_handlers();
   live_devices.push_back(this);
+  env_ = config.env;
   std::string why;
   if (!fake_device_supported(&why)) {
     error_ = why;
@@ -409,7 +414,13 @@ RunResult FakeDevice::run(const std::vector<std::string>& args, const std::strin
         // as a failure here; the binary's leaks are checked under valgrind with a list of the
         // intended ones.
         setenv("ASAN_OPTIONS", "detect_leaks=0", 1);
-        execv(path.c_str(), argv.data());
+        for (const std::string& entry : env_) {
+          size_t eq = entry.find('=');
+          if (eq != std::string::npos) {
+            setenv(entry.substr(0, eq).c_str(), entry.substr(eq + 1).c_str(), 1);
+          }
+        }
+        exec_program(path, argv.data());
         perror("execv");
         return 127;
       },

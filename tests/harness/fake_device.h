@@ -31,6 +31,8 @@ struct FakeDeviceConfig {
   std::string mkfs_options;
   // The fstab line for /data; empty gives the default line naming the userdata node.
   std::string data_fstab_line;
+  // "NAME=value" entries added to the environment of every program run().
+  std::vector<std::string> env;
 };
 
 struct RunResult {
@@ -113,6 +115,7 @@ class FakeDevice {
   std::vector<std::string> mounts_;  // in mount order
   std::string error_;
   bool torn_down_ = false;
+  std::vector<std::string> env_;
   std::function<void(const std::string&)> stderr_listener_;
 };
 
