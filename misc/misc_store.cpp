@@ -29,7 +29,7 @@ void close_misc_stream() {
 }  // namespace
 
 int mfg_open(int item, uint32_t* offset_out, uint32_t* length_out) {
-  if (static_cast<unsigned>(item - 1) >= 4) {
+  if (static_cast<unsigned>(item) - 1u >= 4) {
     printf("Error: item number is out of range, %d\n", item);
     close_misc_stream();
     return -1;

@@ -7,6 +7,8 @@
 
 #include <string>
 
+#include "platform/write_all.h"
+
 #ifndef __BIONIC__
 namespace {
 
@@ -38,9 +40,8 @@ void host_log_writer(const struct __android_logger_data* data, const char* messa
     host_log_fd = open(RB_HOST_LOG_PATH, O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0666);
   }
   int fd = host_log_fd >= 0 ? host_log_fd : STDERR_FILENO;
-  // One write per record, so that records of concurrent writers never interleave.
-  ssize_t ignored = write(fd, line.data(), line.size());
-  (void)ignored;
+  // A record is one write with O_APPEND, so records of concurrent writers stay whole.
+  write_all(fd, line.data(), line.size());
   errno = saved_errno;
 }
 

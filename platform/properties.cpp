@@ -15,6 +15,8 @@ std::string platform_get_property(const std::string& key, const std::string& def
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "platform/write_all.h"
+
 namespace {
 
 // A key names a file in the property directory, so it must be a plain file name.
@@ -63,7 +65,7 @@ extern "C" int property_set(const char* key, const char* value) {
   int fd = mkstemp(&tmp_path[0]);
   if (fd < 0) return -1;
   size_t len = strlen(value);
-  bool ok = write(fd, value, len) == static_cast<ssize_t>(len);
+  bool ok = write_all(fd, value, len);
   ok = fchmod(fd, 0644) == 0 && ok;
   ok = close(fd) == 0 && ok;
   if (!ok || rename(tmp_path.c_str(), final_path.c_str()) != 0) {

@@ -21,7 +21,14 @@ constexpr size_t kCreateChunk = 65536;
 int create_file(const char* path, int64_t size, int progress) {
   // Failures return without releasing the descriptor or the buffer: the process ends soon
   // after, and the buffer is kept on success too.
-  int fd = open(path, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0660);
+  // Without a path (no operand on the command line) the open fails as it would on a bad
+  // pointer.
+  int fd = -1;
+  if (path == nullptr) {
+    errno = EFAULT;
+  } else {
+    fd = open(path, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0660);
+  }
   if (fd < 0) {
     RB_LOGE("failed to open file:%s for writing: %s\n", path != nullptr ? path : "(null)",
             strerror(errno));
@@ -65,6 +72,30 @@ int write_contiguous_headers(int dev_fd, const int64_t* first, uint32_t n, uint3
     encode_chain_block_header(h, buffer + static_cast<int64_t>(k) * block_size);
   }
   return write_retry(dev_fd, buffer, static_cast<size_t>(n * block_size));
+}
+
+void write_chain(int dev_fd, const int64_t* list, uint32_t count, uint8_t* buffer,
+                 int64_t block_size, uint32_t initial_crc, int progress) {
+  uint32_t running_crc = initial_crc;
+  uint32_t start = 0;
+  uint32_t n = 0;
+  for (uint32_t i = 0; i < count; ++i) {
+    if (progress && (i & 0x1FFF) == 0) {
+      fprintf(stderr, "%d/%d\n", static_cast<int>(i), static_cast<int>(count));
+    }
+    if (extends_run(list, i, n)) {
+      ++n;
+      continue;
+    }
+    if (n > 0) {
+      write_contiguous_headers(dev_fd, list + start, n, static_cast<uint32_t>(list[i]), buffer,
+                               block_size, &running_crc);
+    }
+    start = i;
+    n = 1;
+  }
+  write_contiguous_headers(dev_fd, list + start, n, 0, buffer, block_size, &running_crc);
+  if (progress) fprintf(stderr, "%d/%d\n", static_cast<int>(count), static_cast<int>(count));
 }
 
 int raw_write_blocks(const char* block_file, const char* blk_dev, initial_block_header* ibh,
@@ -125,32 +156,13 @@ int raw_write_blocks(const char* block_file, const char* blk_dev, initial_block_
   header.block_count = count;
   header.initial_crc = initial_crc;
   header.state = STATE_ARMED;
-  uint32_t running_crc = initial_crc;
 
   uint8_t* buffer = static_cast<uint8_t*>(calloc(MAX_RUN_BLOCKS, static_cast<size_t>(block_size)));
   if (buffer == nullptr) {
     RB_LOGE("Failed to allocate contiguous block buffer\n");
     return -1;
   }
-  uint32_t start = 0;
-  uint32_t n = 0;
-  for (uint32_t i = 0; i < count; ++i) {
-    if (progress && (i & 0x1FFF) == 0) {
-      fprintf(stderr, "%d/%d\n", static_cast<int>(i), static_cast<int>(count));
-    }
-    if (extends_run(list, i, n)) {
-      ++n;
-      continue;
-    }
-    if (n > 0) {
-      write_contiguous_headers(dev_fd, list + start, n, static_cast<uint32_t>(list[i]), buffer,
-                               block_size, &running_crc);
-    }
-    start = i;
-    n = 1;
-  }
-  write_contiguous_headers(dev_fd, list + start, n, 0, buffer, block_size, &running_crc);
-  if (progress) fprintf(stderr, "%d/%d\n", static_cast<int>(count), static_cast<int>(count));
+  write_chain(dev_fd, list, count, buffer, block_size, initial_crc, progress);
 
   close(fd);
   fsync(dev_fd);

@@ -19,6 +19,13 @@ int create_file(const char* path, int64_t size, int progress);
 int raw_write_blocks(const char* block_file, const char* blk_dev, initial_block_header* ibh,
                      uint32_t initial_crc, int progress);
 
+// Writes the chain over the block list (physical block of logical block i at index i, count
+// of at least 1) through the device, run after run, with "done/total" progress lines on
+// standard error every 8192 blocks when progress is on. A run that fails to be written is
+// logged and the next one is written all the same.
+void write_chain(int dev_fd, const int64_t* list, uint32_t count, uint8_t* buffer,
+                 int64_t block_size, uint32_t initial_crc, int progress);
+
 // Writes the headers of one run of n blocks, starting at the list entry first, through the
 // device; next_block follows the run (0 after the last run). *running_crc advances over the
 // run. buffer holds MAX_RUN_BLOCKS zeroed blocks; only each slot's first 16 bytes are ever

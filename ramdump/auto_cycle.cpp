@@ -121,7 +121,8 @@ int process_auto_ramdump(uint32_t initial_crc, uint32_t progress) {
   } else {
     // Only proves that the file can be mapped; the block found is not used.
     int block = 0;
-    uint8_t raw[INITIAL_BLOCK_HEADER_SIZE];
+    // Zeroed first: a misc partition too short for the item leaves part of it unread.
+    uint8_t raw[INITIAL_BLOCK_HEADER_SIZE] = {};
     if (fibmap(fd, &block) != 0) {
       RB_LOGE("Failed to get block 0 for file %s; %s\n", RAMDUMP_RESERVED_PATH, strerror(errno));
     } else if (MISC_read_RamdumpIBH(raw) != 0) {

@@ -18,7 +18,8 @@ int stat_block_file(const char* path, int64_t* block_size, uint32_t* count, int6
   }
   *block_size = static_cast<int32_t>(st.st_blksize);
   *size = st.st_size;
-  *count = static_cast<uint32_t>(*size / *block_size);
+  // No Linux file system reports a block size of 0; if one did, the file holds no blocks.
+  *count = *block_size > 0 ? static_cast<uint32_t>(*size / *block_size) : 0;
   return 0;
 }
 

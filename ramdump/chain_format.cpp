@@ -77,23 +77,3 @@ chain_block_header make_chain_block_header(uint32_t block, uint32_t next_block, 
   *running_crc = h.crc;
   return h;
 }
-
-uint32_t chain_run_length(const int64_t* blocks, uint32_t count, uint32_t start) {
-  uint32_t n = 1;
-  while (start + n < count && extends_run(blocks, start + n, n)) ++n;
-  return n;
-}
-
-void build_chain_headers(const int64_t* blocks, uint32_t count, uint32_t initial_crc,
-                         chain_block_header* out) {
-  uint32_t running_crc = initial_crc;
-  for (uint32_t start = 0; start < count;) {
-    uint32_t n = chain_run_length(blocks, count, start);
-    for (uint32_t k = 0; k < n; ++k) {
-      uint32_t i = start + k;
-      uint32_t next = i + 1 < count ? static_cast<uint32_t>(blocks[i + 1]) : 0;
-      out[i] = make_chain_block_header(static_cast<uint32_t>(blocks[i]), next, n, k, &running_crc);
-    }
-    start += n;
-  }
-}

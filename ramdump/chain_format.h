@@ -73,12 +73,3 @@ chain_block_header make_chain_block_header(uint32_t block, uint32_t next_block, 
 inline bool extends_run(const int64_t* blocks, uint32_t i, uint32_t n) {
   return n > 0 && n < MAX_RUN_BLOCKS && blocks[i] == blocks[i - 1] + 1;
 }
-
-// The length of the run that starts at index start.
-uint32_t chain_run_length(const int64_t* blocks, uint32_t count, uint32_t start);
-
-// Every header of the chain over the block list, in chain order, starting from initial_crc:
-// the definition that arming writes and that the firmware simulator and tests verify.
-// out must hold count headers.
-void build_chain_headers(const int64_t* blocks, uint32_t count, uint32_t initial_crc,
-                         chain_block_header* out);

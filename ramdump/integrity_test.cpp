@@ -41,7 +41,7 @@ int test_block_chain(const char* block_file, const char* blk_dev, uint32_t initi
 
   uint32_t block = static_cast<uint32_t>(first);
   uint32_t running_crc = initial_crc;
-  int count = 0;
+  uint32_t count = 0;  // a looping chain is walked for ever; the count just wraps
   bool mismatch = false;
   for (;;) {
     off64_t offset = static_cast<off64_t>(block) * block_size;
@@ -67,7 +67,7 @@ int test_block_chain(const char* block_file, const char* blk_dev, uint32_t initi
     }
     ++count;
     if (h.next_block == 0) {
-      RB_LOGI("Read %d blocks successfully\n", count);
+      RB_LOGI("Read %d blocks successfully\n", static_cast<int>(count));
       if (mismatch) RB_LOGW("Integrity of chain not verified due to CRC mismatch\n");
       close(dev_fd);
       return 0;
