@@ -11,6 +11,60 @@
 #include "ramdump/block_map.h"
 #include "ramdump/retry_io.h"
 
+namespace {
+
+// Physically consecutive blocks are copied with one read and one write of up to this many
+// bytes, as fast as the device streams.
+constexpr int64_t kRunBytes = 4 << 20;
+
+// One block: seek, read it into the one-block buffer (a device that ends early leaves the
+// rest of the buffer as it was) and write the buffer whole.
+int copy_block(int dev_fd, int out_fd, uint32_t block, int64_t block_size, uint8_t* buf) {
+  if (seek_retry(dev_fd, static_cast<off64_t>(block) * block_size) < 0) {
+    RB_LOGE("error seeking to block %08x: %s\n", block, strerror(errno));
+    return -1;
+  }
+  if (read_retry(dev_fd, buf, static_cast<size_t>(block_size)) < 0 ||
+      write_retry(out_fd, buf, static_cast<size_t>(block_size)) < 0) {
+    return -1;
+  }
+  return 0;
+}
+
+// Reads exactly length bytes; false on an error or an early end, which the caller handles
+// by going block by block.
+bool read_whole(int fd, uint8_t* p, size_t length) {
+  while (length > 0) {
+    ssize_t n = read(fd, p, length);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return false;
+    p += n;
+    length -= static_cast<size_t>(n);
+  }
+  return true;
+}
+
+// n physically consecutive blocks from first. When the device delivers them all they are
+// copied in one piece; otherwise block by block, so that a read error or an early end of the
+// device leaves the same output and the same messages as a copy one block at a time.
+int copy_run(int dev_fd, int out_fd, uint32_t first, uint32_t n, int64_t block_size, uint8_t* buf,
+             uint8_t* run_buf) {
+  const size_t bytes = static_cast<size_t>(n * block_size);
+  if (n > 1 && seek_retry(dev_fd, static_cast<off64_t>(first) * block_size) >= 0 &&
+      read_whole(dev_fd, run_buf, bytes)) {
+    if (write_retry(out_fd, run_buf, bytes) < 0) return -1;
+    // As after a copy block by block, the one-block buffer holds the last block.
+    memcpy(buf, run_buf + bytes - block_size, static_cast<size_t>(block_size));
+    return 0;
+  }
+  for (uint32_t k = 0; k < n; ++k) {
+    if (copy_block(dev_fd, out_fd, first + k, block_size, buf) != 0) return -1;
+  }
+  return 0;
+}
+
+}  // namespace
+
 int raw_read_blocks(const char* block_file, const char* blk_dev, const char* out_file) {
   int64_t block_size;
   uint32_t count;
@@ -44,23 +98,50 @@ int raw_read_blocks(const char* block_file, const char* blk_dev, const char* out
   }
   RB_LOGI("Opened %s for writing\n", out_file);
 
+  // Without room for a whole run the copy simply goes one block at a time.
+  uint32_t run_blocks = block_size < kRunBytes ? static_cast<uint32_t>(kRunBytes / block_size) : 1;
+  uint8_t* run_buf = nullptr;
+  if (run_blocks > 1) run_buf = static_cast<uint8_t*>(malloc(static_cast<size_t>(kRunBytes)));
+  if (run_buf == nullptr) run_blocks = 1;
+
+  // Blocks are mapped ahead up to the end of their run; a block that cannot be mapped is
+  // reported only after every block before it has been copied.
   int result = 0;
-  for (uint32_t i = 0; i < count; ++i) {
+  int next_mapped = 0;
+  bool next_known = false;
+  for (uint32_t i = 0; i < count;) {
     // A hole maps to 0 and is not refused here: block 0 of the device is read instead.
-    int block = static_cast<int>(i);
-    if (fibmap(in_fd, &block) != 0) {
+    int first = static_cast<int>(i);
+    if (next_known) {
+      first = next_mapped;
+    } else if (fibmap(in_fd, &first) != 0) {
       RB_LOGE("failed to find block %d\n", static_cast<int>(i));
       result = -1;
       break;
     }
-    off64_t offset = static_cast<off64_t>(static_cast<uint32_t>(block)) * block_size;
-    if (seek_retry(dev_fd, offset) < 0) {
-      RB_LOGE("error seeking to block %08x: %s\n", static_cast<unsigned>(block), strerror(errno));
+    next_known = false;
+    uint32_t n = 1;
+    bool unmappable = false;
+    while (n < run_blocks && i + n < count) {
+      int block = static_cast<int>(i + n);
+      if (fibmap(in_fd, &block) != 0) {
+        unmappable = true;
+        break;
+      }
+      if (static_cast<int64_t>(block) != static_cast<int64_t>(first) + n) {
+        next_mapped = block;
+        next_known = true;
+        break;
+      }
+      ++n;
+    }
+    if (copy_run(dev_fd, out_fd, static_cast<uint32_t>(first), n, block_size, buf, run_buf) != 0) {
       result = -1;
       break;
     }
-    if (read_retry(dev_fd, buf, static_cast<size_t>(block_size)) < 0 ||
-        write_retry(out_fd, buf, static_cast<size_t>(block_size)) < 0) {
+    i += n;
+    if (unmappable) {
+      RB_LOGE("failed to find block %d\n", static_cast<int>(i));
       result = -1;
       break;
     }
@@ -69,6 +150,7 @@ int raw_read_blocks(const char* block_file, const char* blk_dev, const char* out
   close(dev_fd);
   fsync(out_fd);
   close(out_fd);
+  free(run_buf);
   free(buf);
   return result;
 }
