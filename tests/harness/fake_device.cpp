@@ -10,6 +10,7 @@
 #include <string.h>
 #include <sys/ioctl.h>
 #include <sys/mount.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/statvfs.h>
 #include <sys/sysmacros.h>
@@ -52,9 +53,29 @@ std::string dirname_of(const std::string& path) {
   return slash == std::string::npos || slash == 0 ? "/" : path.substr(0, slash);
 }
 
+}  // namespace
+
 // Starts a program of the root (path inside the root, argv[0] as given); returns only on
-// failure.
-void exec_program(const std::string& path, char** argv) { execv(path.c_str(), argv); }
+// failure. When RB_TEST_WRAPPER names a qemu-user emulator (a path inside the root, such as
+// /usr/bin/qemu-aarch64-static), the program runs under it: that is how the tests drive
+// programs built for another architecture. Its -0 keeps argv[0] as given, which the usage
+// text shows. The emulator finds the program's shared libraries where the root shows the
+// host's /usr, so their packages have to be installed for that architecture too.
+void exec_program(const std::string& path, char** argv) {
+  const char* wrapper = getenv("RB_TEST_WRAPPER");
+  if (wrapper == nullptr || wrapper[0] == '\0') {
+    execv(path.c_str(), argv);
+    return;
+  }
+  std::string argv0_flag = "-0";
+  std::vector<char*> wrapped = {const_cast<char*>(wrapper), &argv0_flag[0], argv[0],
+                                const_cast<char*>(path.c_str())};
+  for (char** arg = argv + 1; *arg != nullptr; ++arg) wrapped.push_back(*arg);
+  wrapped.push_back(nullptr);
+  execv(wrapper, wrapped.data());
+}
+
+namespace {
 
 // Live devices, so that a signal can tear them down before the process dies.
 std::vector<FakeDevice*> live_devices;
@@ -376,7 +397,9 @@ RunResult FakeDevice::wait_child(pid_t pid, const std::string& out_path,
   };
   for (;;) {
     feed_listener();
-    pid_t done = waitpid(pid, &wstatus, WNOHANG);
+    struct rusage usage;
+    pid_t done = wait4(pid, &wstatus, WNOHANG, &usage);
+    if (done == pid) result.max_rss_kb = usage.ru_maxrss;
     if (done == pid) break;
     if (done < 0 && errno != EINTR) break;
     struct timespec now;
@@ -390,6 +413,9 @@ RunResult FakeDevice::wait_child(pid_t pid, const std::string& out_path,
     usleep(stderr_listener_ ? 50000 : 2000);
   }
   feed_listener();
+  struct timespec end;
+  clock_gettime(CLOCK_MONOTONIC, &end);
+  result.seconds = (end.tv_sec - start.tv_sec) + (end.tv_nsec - start.tv_nsec) / 1e9;
   result.status = WIFEXITED(wstatus) ? WEXITSTATUS(wstatus) : 128 + WTERMSIG(wstatus);
   result.out = read_host_file(out_path);
   result.err = read_host_file(err_path);

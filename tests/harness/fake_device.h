@@ -40,6 +40,8 @@ struct RunResult {
   std::string err;
   int status = -1;  // exit status, or 128 + signal number
   bool timed_out = false;
+  double seconds = 0;   // wall time
+  long max_rss_kb = 0;  // peak resident memory of the program
 };
 
 class FakeDevice {
@@ -121,6 +123,12 @@ class FakeDevice {
 
 // Whether the harness can run here (root), and why not.
 bool fake_device_supported(std::string* why);
+
+// Replaces the calling process with a program of the root (path inside the root, argv[0] as
+// given), as run() does: under the emulator named by RB_TEST_WRAPPER when that is set (see
+// scripts/test-aarch64.sh). Returns only on failure. For tests that start a program
+// themselves inside run_in_root().
+void exec_program(const std::string& path, char** argv);
 
 // In a test: skips when the harness cannot run here, fails when the root was not set up.
 #define REQUIRE_DEVICE(device)                                              \
