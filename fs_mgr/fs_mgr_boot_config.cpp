@@ -27,10 +27,16 @@ const std::string kDefaultAndroidDtDir("/proc/device-tree/firmware/android");
 
 bool fs_mgr_get_boot_config_from_kernel_cmdline(const std::string& key, std::string* out_val) {
   FS_MGR_CHECK_OUT(out_val);
-  const std::string name = "androidboot." + key;
   std::string cmdline;
   if (!android::base::ReadFileToString("/proc/cmdline", &cmdline)) return false;
-  // The kernel passes no quoting through: a value never contains a space.
+  return fs_mgr_get_boot_config_from_cmdline_text(cmdline, key, out_val);
+}
+
+bool fs_mgr_get_boot_config_from_cmdline_text(const std::string& cmdline, const std::string& key,
+                                              std::string* out_val) {
+  FS_MGR_CHECK_OUT(out_val);
+  const std::string name = "androidboot." + key;
+  // Quoting is not recognised: a quoted value with a space in it is split like the rest.
   for (const std::string& entry : android::base::Split(android::base::Trim(cmdline), " ")) {
     std::vector<std::string> pieces = android::base::Split(entry, "=");
     if (pieces.size() == 2 && pieces[0] == name) {

@@ -8,6 +8,9 @@
 
 // "androidboot.<key>=value" on /proc/cmdline; out_val is left alone when there is no match.
 bool fs_mgr_get_boot_config_from_kernel_cmdline(const std::string& key, std::string* out_val);
+// The same lookup in a command line given as text (what /proc/cmdline holds).
+bool fs_mgr_get_boot_config_from_cmdline_text(const std::string& cmdline, const std::string& key,
+                                              std::string* out_val);
 // Property "ro.boot.<key>", then the kernel command line, then the device tree.
 bool fs_mgr_get_boot_config(const std::string& key, std::string* out_val);
 // The device-tree directory of the firmware's settings, settled once per process.

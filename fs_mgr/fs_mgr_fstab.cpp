@@ -46,8 +46,8 @@ struct flag_list {
   int flag;
 };
 
-// Options are matched by prefix and the first matching row wins, so the row order matters:
-// "verifyatboot" must come before "verify".
+// Options are matched by prefix and the first matching row wins, so the row order of these
+// tables matters.
 const flag_list mount_flag_list[] = {
     {"noatime", MS_NOATIME},
     {"noexec", MS_NOEXEC},
@@ -67,6 +67,7 @@ const flag_list mount_flag_list[] = {
     {nullptr, 0},
 };
 
+// "verifyatboot" must come before "verify".
 const flag_list fs_mgr_flag_list[] = {
     {"wait", MF_WAIT},
     {"check", MF_CHECK},
@@ -132,7 +133,7 @@ void bounded_append(char* dst, size_t dst_size, const char* src) {
   dst[used + n] = '\0';
 }
 
-// A block size is only usable when it is a power of two of at least one page.
+// A block size is only usable when it is a power of two of at least 4096 bytes.
 unsigned int usable_block_size(const char* value) {
   unsigned int size = static_cast<unsigned int>(strtoul(value, nullptr, 0));
   return size >= 4096 && (size & (size - 1)) == 0 ? size : 0;
@@ -310,27 +311,12 @@ const char* parse_entry(char* line, fstab_rec* rec) {
   if ((token = strtok_r(nullptr, kDelim, &save)) == nullptr) return "Error parsing mount_flags";
   char options[1024];
   memset(options, 0, sizeof(options));
-  int mount_flags = parse_flags(token, mount_flag_list, nullptr, options, sizeof(options));
+  int mount_flags = fs_mgr_parse_mount_options(token, options, sizeof(options));
   rec->mount_flags = static_cast<unsigned long>(static_cast<long>(mount_flags));
   rec->fs_options = options[0] != '\0' ? strdup(options) : nullptr;
 
   if ((token = strtok_r(nullptr, kDelim, &save)) == nullptr) return "Error parsing fs_mgr_options";
-  fs_mgr_flag_values values;
-  rec->fs_mgr_flags = parse_flags(token, fs_mgr_flag_list, &values, nullptr, 0);
-  rec->key_location = values.key_location;
-  rec->key_directory = values.key_directory;
-  rec->verify_value = values.verify_value;
-  rec->length = values.length;
-  rec->vold_label = values.vold_label;
-  rec->vold_partnum = values.vold_partnum;
-  rec->swap_prio = values.swap_prio;
-  rec->max_comp_streams = values.max_comp_streams;
-  rec->zram_size = values.zram_size;
-  rec->reserved_size = values.reserved_size;
-  rec->file_contents_mode = values.file_contents_mode;
-  rec->file_names_mode = values.file_names_mode;
-  rec->erase_blk_size = values.erase_blk_size;
-  rec->logical_blk_size = values.logical_blk_size;
+  rec->fs_mgr_flags = fs_mgr_parse_fs_mgr_options(token, rec);
   return nullptr;
 }
 
@@ -398,6 +384,30 @@ fstab* in_place_merge(fstab* a, fstab* b) {
 }
 
 }  // namespace
+
+int fs_mgr_parse_mount_options(char* text, char* out, size_t out_size) {
+  return parse_flags(text, mount_flag_list, nullptr, out, out_size);
+}
+
+int fs_mgr_parse_fs_mgr_options(char* text, fstab_rec* rec) {
+  fs_mgr_flag_values values;
+  int flags = parse_flags(text, fs_mgr_flag_list, &values, nullptr, 0);
+  rec->key_location = values.key_location;
+  rec->key_directory = values.key_directory;
+  rec->verify_value = values.verify_value;
+  rec->length = values.length;
+  rec->vold_label = values.vold_label;
+  rec->vold_partnum = values.vold_partnum;
+  rec->swap_prio = values.swap_prio;
+  rec->max_comp_streams = values.max_comp_streams;
+  rec->zram_size = values.zram_size;
+  rec->reserved_size = values.reserved_size;
+  rec->file_contents_mode = values.file_contents_mode;
+  rec->file_names_mode = values.file_names_mode;
+  rec->erase_blk_size = values.erase_blk_size;
+  rec->logical_blk_size = values.logical_blk_size;
+  return flags;
+}
 
 fstab* fs_mgr_read_fstab_file(FILE* stream) {
   char* line = nullptr;

@@ -88,3 +88,10 @@ fstab* fs_mgr_read_fstab_default();
 void fs_mgr_free_fstab(fstab* table);
 // The record's encryptable=, forceencrypt= and forcefdeorfbe= bits (not 0 or 1).
 int fs_mgr_is_encryptable(const fstab_rec* rec);
+
+// The two option columns as the parser reads them; text is cut up in place. Column 4: returns
+// the mount flags, and the options that are not mount flags go to out, joined with "," and cut
+// to out_size bytes. Column 5: returns the fs_mgr flags and stores the options' values in
+// rec's fields key_location to logical_blk_size, overwriting them.
+int fs_mgr_parse_mount_options(char* text, char* out, size_t out_size);
+int fs_mgr_parse_fs_mgr_options(char* text, fstab_rec* rec);
