@@ -1,8 +1,11 @@
 #!/usr/bin/env bash
 # Runs every test: installs what is missing, builds the tool and the tests twice (plain, and
-# with AddressSanitizer + UndefinedBehaviorSanitizer), and runs CTest on both. The full-size
-# crash cycle (4 GiB written and read back) runs in the plain build only. Run as root: the
-# device tests use loop devices, mount namespaces and chroot (without root they are skipped).
+# with AddressSanitizer + UndefinedBehaviorSanitizer), fuzzes the parsers and the dump stream
+# filter for a bounded time (scripts/fuzz.sh), runs the main paths under valgrind
+# (scripts/valgrind.sh), tests the aarch64 build under emulation (scripts/test-aarch64.sh),
+# and runs CTest on both builds. The full-size crash cycle (4 GiB
+# written and read back) runs in the plain build only. Run as root: the device tests use loop
+# devices, mount namespaces and chroot (without root they are skipped).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
@@ -25,6 +28,11 @@ run_ctest() {
 }
 
 status=0
+# Each fuzz target for a minute in its own clang build, and the main paths under valgrind.
+bash scripts/fuzz.sh || status=1
+bash scripts/valgrind.sh build || status=1
+# The aarch64 build under qemu-user, and its bytes against the x86-64 build's.
+bash scripts/test-aarch64.sh || status=1
 run_ctest build-asan -E 'FullCrashCycleAtFullSize' || status=1
 run_ctest build || status=1
 
