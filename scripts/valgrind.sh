@@ -1,11 +1,10 @@
 #!/usr/bin/env bash
-# Runs the tool's main paths under valgrind's memcheck in the fake device root (see
-# tests/fault/valgrind_paths.cpp): no invalid read or write, no leak but those listed in
-# tests/fault/valgrind.supp. Installs valgrind when missing and builds the plain build
-# directory given (default: build) first. Run as root.
+# Runs the tool's main paths under valgrind's memcheck in the fake device root
+# (tests/fault/valgrind_paths.cpp): no invalid access, no leak but those listed in
+# tests/fault/valgrind.supp. Installs valgrind when missing and first builds the plain build
+# directory given (default: build). Run as root.
 set -euo pipefail
 cd "$(dirname "$0")/.."
-
 build_dir=${1:-build}
 if [ "$(id -u)" -ne 0 ]; then
   echo "valgrind: skipped, the fake device root needs root"

@@ -2,11 +2,11 @@
 
 #include <fcntl.h>
 #include <linux/fs.h>
-#include <stdio.h>
 #include <sys/ioctl.h>
 #include <unistd.h>
 #include <zlib.h>
 
+#include <iomanip>
 #include <sstream>
 
 namespace {
@@ -15,6 +15,12 @@ std::string le32(uint32_t v) {
   std::string s(4, '\0');
   for (int i = 0; i < 4; ++i) s[i] = static_cast<char>(v >> (8 * i));
   return s;
+}
+
+std::string hex(const std::string& bytes) {
+  std::ostringstream text;
+  for (unsigned char c : bytes) text << std::hex << std::setw(2) << std::setfill('0') << +c;
+  return text.str();
 }
 
 }  // namespace
@@ -32,60 +38,41 @@ std::vector<long> map_file(const FakeDevice& device, const std::string& path, ui
 
 std::string verify_chain(const FakeDevice& device, const std::vector<long>& blocks,
                          uint32_t initial_crc, bool payload_zero) {
-  const size_t kBlock = 4096;
+  const size_t length = payload_zero ? 4096 : 16;
   int fd = open(device.data_device().c_str(), O_RDONLY | O_CLOEXEC);
-  if (fd < 0) return "cannot open the raw device";
-  std::string raw(kBlock, '\0');
-  std::string result;
+  std::string raw(length, '\0'), problem;
   uint32_t crc = initial_crc;
-  size_t run_end = 0;
-  for (size_t i = 0; i < blocks.size(); ++i) {
+  for (size_t i = 0, run_end = 0; i < blocks.size() && problem.empty(); ++i) {
     // A new run starts where the last one ended: consecutive physical blocks, at most 1024.
     if (i == run_end) {
-      run_end = i + 1;
-      while (run_end < blocks.size() && run_end - i < 1024 &&
-             blocks[run_end] == blocks[run_end - 1] + 1) {
-        ++run_end;
+      for (++run_end; run_end < blocks.size() && run_end - i < 1024 &&
+                      blocks[run_end] == blocks[run_end - 1] + 1;
+           ++run_end) {
       }
     }
-    uint32_t block = static_cast<uint32_t>(blocks[i]);
-    uint32_t next = i + 1 < blocks.size() ? static_cast<uint32_t>(blocks[i + 1]) : 0;
-    std::string numbers = le32(block) + le32(next);
+    const uint32_t block = static_cast<uint32_t>(blocks[i]);
+    const uint32_t next = i + 1 < blocks.size() ? static_cast<uint32_t>(blocks[i + 1]) : 0;
+    const std::string numbers = le32(block) + le32(next);
     crc = static_cast<uint32_t>(
         crc32(crc, reinterpret_cast<const Bytef*>(numbers.data()), numbers.size()));
-    size_t length = payload_zero ? kBlock : 16;
-    ssize_t got = pread(fd, &raw[0], length, static_cast<off_t>(block) * kBlock);
-    std::ostringstream where;
-    where << "chain block " << i << " (physical " << block << "): ";
-    if (got != static_cast<ssize_t>(length)) {
-      where << "short read";
-    } else if (raw.compare(0, 4, "BCho") != 0) {
-      where << "bad magic";
-    } else if (le32_at(raw, 4) != next) {
-      where << "next " << le32_at(raw, 4) << ", expected " << next;
-    } else if (le16_at(raw, 8) != 0) {
-      where << "reserved bytes not zero";
-    } else if (le16_at(raw, 10) != run_end - i) {
-      where << "run_remaining " << le16_at(raw, 10) << ", expected " << run_end - i;
-    } else if (le32_at(raw, 12) != crc) {
-      where << "crc " << std::hex << le32_at(raw, 12) << ", expected " << crc;
-    } else if (payload_zero && raw.find_first_not_of('\0', 16) != std::string::npos) {
-      where << "payload not zero";
-    } else {
-      continue;
+    // Magic, next block, 16 reserved bits (0), run_remaining, CRC; then zeros if asked.
+    const std::string header = "BCho" + le32(next) + le32((run_end - i) << 16) + le32(crc);
+    if (pread(fd, &raw[0], length, static_cast<off_t>(block) * 4096) != ssize_t(length) ||
+        raw.compare(0, 16, header) != 0 ||
+        (payload_zero && raw.find_first_not_of('\0', 16) != std::string::npos)) {
+      problem = "chain block " + std::to_string(i) + " (physical " + std::to_string(block) +
+                "): header " + hex(raw.substr(0, 16)) + ", expected " + hex(header) +
+                (payload_zero ? " and zeros" : "");
     }
-    result = where.str();
-    break;
   }
-  close(fd);
-  return result;
+  if (fd >= 0) close(fd);
+  return problem;
 }
 
 std::string tool_log(const FakeDevice& device) {
   std::istringstream in(device.log());
-  std::string line;
   std::string kept;
-  while (std::getline(in, line)) {
+  for (std::string line; std::getline(in, line);) {
     if (line.find("[libfs_mgr]") == std::string::npos) kept += line + "\n";
   }
   return kept;

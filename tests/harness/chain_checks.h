@@ -1,6 +1,6 @@
-// Checks of the chain as the firmware will find it, read back through the raw device of a
-// fake device and compared with what the test itself computes from the file system's block
-// map (FIBMAP) and zlib's crc32.
+// The chain as the firmware will find it, read back through the raw device of a fake device and
+// compared with what the test computes itself from the file system's block map (FIBMAP) and
+// zlib's crc32.
 #pragma once
 
 #include <stdint.h>
@@ -10,22 +10,19 @@
 
 #include "tests/harness/fake_device.h"
 
-// The physical blocks of a file's first count logical blocks; -1 entries where unmapped.
+// The physical blocks of a file's first count logical blocks; -1 where unmapped.
 std::vector<long> map_file(const FakeDevice& device, const std::string& path, uint32_t count);
 
-// "" when every block of the chain over blocks carries the expected header (magic "BCho",
-// next block, reserved 0, run length countdown with runs cut at 1024, chain CRC from
-// initial_crc) and, when payload_zero, zeros in the rest of the block; otherwise the first
-// difference.
+// "" when every block of the chain over blocks carries the expected header (magic "BCho", next
+// block, reserved 0, run length countdown with runs cut at 1024, chain CRC from initial_crc)
+// and, when payload_zero, zeros in the rest of the block; otherwise the first difference.
 std::string verify_chain(const FakeDevice& device, const std::vector<long>& blocks,
                          uint32_t initial_crc, bool payload_zero);
 
 // The tool's own log records, without the mount table reader's "[libfs_mgr]" lines.
 std::string tool_log(const FakeDevice& device);
 
-// The 24-byte initial block header item as stored in a misc image.
+// The 24-byte initial block header item as stored in the misc image, and one built from fields.
 std::string stored_ibh(const FakeDevice& device);
-
-// Builds an initial block header item.
 std::string make_ibh(uint32_t first_block, uint32_t block_size, uint32_t count, uint32_t crc,
                      uint32_t state);

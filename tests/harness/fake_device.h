@@ -1,13 +1,8 @@
-// A throw-away Android-like root for running the real binaries at the fixed paths they use
-// (/data/vendor/ramdump, the misc partition links, /proc/cmdline, /vendor/etc/fstab.*).
-//
-// The test process first enters a private mount namespace (see device_test_main.cpp), so
-// every mount made here disappears with the process even if it is killed. The root is a tmpfs
-// with /usr bound read-only (Debian's /bin and /lib are links into /usr), a fresh /proc with a
-// fixture file over /proc/cmdline, the misc partition as plain image files at either or both
-// device links, the property directory, and optionally /data as a real ext4 file system on a
-// loop device whose node is at /dev/block/bootdevice/by-name/userdata and listed in
-// /vendor/etc/fstab.<hardware>.
+// A throw-away Android-like root for running the real binaries at the fixed paths they use:
+// a tmpfs with /usr bound read-only, /proc with a fixture /proc/cmdline, the misc partition as
+// image files, the property directory, the programs in /system/bin, and optionally /data as ext4
+// on a self-detaching loop device. The process is in a private mount namespace
+// (device_test_main.cpp), so every mount vanishes with it even if it is killed.
 #pragma once
 
 #include <stdint.h>
@@ -17,31 +12,39 @@
 #include <string>
 #include <vector>
 
+#define USERDATA_DEVICE "/dev/block/bootdevice/by-name/userdata"
+#define MISC_DEVICE "/dev/block/bootdevice/by-name/misc"
+
+// Whole host files ("" when absent).
+std::string read_host_file(const std::string& path);
+void write_host_file(const std::string& path, const std::string& content);
+
+// The little-endian 32-bit word at offset.
+uint32_t le32_at(const std::string& bytes, size_t offset);
+
+inline bool contains(const std::string& text, const std::string& part) {
+  return text.find(part) != std::string::npos;
+}
+
 struct FakeDeviceConfig {
-  bool misc_primary = false;   // image at /dev/block/platform/msm_sdcc.1/by-name/misc
-  bool misc_secondary = true;  // image at /dev/block/bootdevice/by-name/misc
-  uint64_t misc_bytes = 1 << 20;
-  uint8_t misc_fill = 0;  // every byte of a new misc image
-  std::string hardware = "rbtest";
-  // Written to the file bound over /proc/cmdline.
+  // Implicit, so that FakeDevice device(64u << 20) has a 64 MiB /data.
+  FakeDeviceConfig(uint64_t data_bytes = 0) : data_bytes(data_bytes) {}
+  bool misc_primary = false;   // a 1 MiB image at /dev/block/platform/msm_sdcc.1/by-name/misc
+  bool misc_secondary = true;  // a 1 MiB image at /dev/block/bootdevice/by-name/misc
+  uint8_t misc_fill = 0;
   std::string cmdline = "console=ttyMSM0 androidboot.hardware=rbtest\n";
-  // Nonzero: /data is an ext4 file system of this many bytes (a sparse image).
-  uint64_t data_bytes = 0;
-  // Extra options for mkfs.ext4, e.g. "-E nodiscard".
-  std::string mkfs_options;
-  // The fstab line for /data; empty gives the default line naming the userdata node.
-  std::string data_fstab_line;
-  // "NAME=value" entries added to the environment of every program run().
-  std::vector<std::string> env;
+  uint64_t data_bytes;       // nonzero: /data is a (sparse) ext4 image of this size
+  std::string mkfs_options;  // extra options for mkfs.ext4
+  std::string fstab =        // /vendor/etc/fstab.rbtest
+      USERDATA_DEVICE " /data ext4 noatime,nosuid,nodev,barrier=1 wait,check,encryptable=footer\n";
 };
 
 struct RunResult {
-  std::string out;
-  std::string err;
+  std::string out, err;
   int status = -1;  // exit status, or 128 + signal number
   bool timed_out = false;
   double seconds = 0;   // wall time
-  long max_rss_kb = 0;  // peak resident memory of the program
+  long max_rss_kb = 0;  // peak resident memory
 };
 
 class FakeDevice {
@@ -54,104 +57,76 @@ class FakeDevice {
   // Empty when the root was set up; otherwise what went wrong.
   const std::string& setup_error() const { return error_; }
 
-  // The host path of a path inside the root.
-  std::string host_path(const std::string& device_path) const;
-
+  // Files of the root, by their path inside it.
+  std::string host_path(const std::string& device_path) const { return root_ + device_path; }
   void write_file(const std::string& device_path, const std::string& content, mode_t mode = 0644);
-  std::string read_file(const std::string& device_path) const;
+  std::string read_file(const std::string& path) const { return read_host_file(host_path(path)); }
   bool exists(const std::string& device_path) const;
-  void remove(const std::string& device_path);
-  void make_dirs(const std::string& device_path);
+  void remove(const std::string& device_path);  // a file or an empty directory
 
-  void set_property(const std::string& name, const std::string& value);
-  std::string property(const std::string& name) const;  // absent reads as ""
+  void set_property(const std::string& name, const std::string& value) {
+    write_file("/dev/__properties__/" + name, value);
+  }
+  std::string property(const std::string& name) const {  // absent reads as ""
+    return read_file("/dev/__properties__/" + name);
+  }
+  // The system log, one record per line (platform/log.h).
+  std::string log() const { return read_file("/dev/__log__"); }
+  void clear_log() { remove("/dev/__log__"); }
 
-  // The system log file of the root, one record per line (see platform/log.h).
-  std::string log() const;
-  void clear_log();
-
-  // Runs a program of the build directory (copied to /system/bin) chrooted into the root,
-  // with argv[0] = program. A run longer than timeout_seconds is killed.
+  // Runs /system/bin/<program> chrooted into the root (argv[0] = program); a run longer than
+  // timeout_seconds is killed.
   RunResult run(const std::vector<std::string>& args, const std::string& program = "reserveblocks",
                 int timeout_seconds = 600);
-
-  // Called with each line a program run by run() writes to standard error, while it runs
-  // (for showing progress live); an empty function turns it off.
+  // Runs fn in a child chrooted into the root; its result is the exit status.
+  RunResult run_in_root(const std::function<int()>& fn, int timeout_seconds = 60);
+  // Gets each line that a run writes to standard error while it runs; empty: off.
   void set_stderr_listener(std::function<void(const std::string&)> listener) {
     stderr_listener_ = std::move(listener);
   }
 
-  // Runs fn in a child chrooted into the root; its result is the exit status, its standard
-  // output and error are captured.
-  RunResult run_in_root(const std::function<int()>& fn, int timeout_seconds = 60);
+  std::string misc_host_path(bool primary = false) const {
+    return host_path(primary ? "/dev/block/platform/msm_sdcc.1/by-name/misc" : MISC_DEVICE);
+  }
+  std::string misc_bytes(bool primary = false) const {
+    return read_host_file(misc_host_path(primary));
+  }
 
-  // The host path of a misc image (primary or secondary link), and its bytes.
-  std::string misc_host_path(bool primary = false) const;
-  std::string misc_bytes(bool primary = false) const;
-
-  // The raw /data device: its host node, raw reads and writes through it, and the physical
-  // block of a file's logical block as the file system maps it (FIBMAP), -1 on failure.
+  // The raw /data device (host node) and reads and writes through it.
   const std::string& data_device() const { return loop_device_; }
   std::string read_raw(uint64_t offset, size_t length) const;
   void write_raw(uint64_t offset, const std::string& bytes) const;
-  long map_block(const std::string& device_path, uint32_t logical) const;
 
-  // Fills /data so that statvfs reports exactly this many available bytes (f_bavail *
-  // f_bsize), with filler files under /data/filler. Returns false if it cannot.
+  // Fills /data (files under /data/filler) until statvfs reports exactly this many available
+  // bytes; false if it cannot.
   bool set_free_space(uint64_t bytes);
   uint64_t free_space() const;
 
-  // Tears everything down; also called by the destructor and on SIGINT/SIGTERM.
+  // Unmounts everything and removes the work directory; also run by the destructor and on
+  // SIGINT, SIGTERM, SIGHUP and SIGPIPE.
   void teardown();
 
  private:
-  bool setup(const FakeDeviceConfig& config);
-  bool fail(const std::string& what);
-  RunResult wait_child(pid_t pid, const std::string& out_path, const std::string& err_path,
-                       int timeout_seconds);
-  bool setup_data(const FakeDeviceConfig& config);
+  void setup(const FakeDeviceConfig& config);
 
-  std::string work_;  // host temp directory
+  std::string work_;  // host temporary directory
   std::string root_;  // work_/root, a tmpfs
-  std::string loop_device_;
-  std::vector<std::string> mounts_;  // in mount order
-  std::string error_;
-  bool torn_down_ = false;
-  std::vector<std::string> env_;
+  bool root_mounted_ = false;
+  std::string loop_device_, error_;
   std::function<void(const std::string&)> stderr_listener_;
 };
 
 // Whether the harness can run here (root), and why not.
 bool fake_device_supported(std::string* why);
 
-// Replaces the calling process with a program of the root (path inside the root, argv[0] as
-// given), as run() does: under the emulator named by RB_TEST_WRAPPER when that is set (see
-// scripts/test-aarch64.sh). Returns only on failure. For tests that start a program
-// themselves inside run_in_root().
+// Replaces the process with a program of the root (path inside it) as run() does: under the
+// emulator named by RB_TEST_WRAPPER when that is set (scripts/test-aarch64.sh). Returns only on
+// failure.
 void exec_program(const std::string& path, char** argv);
 
 // In a test: skips when the harness cannot run here, fails when the root was not set up.
 #define REQUIRE_DEVICE(device)                                              \
   do {                                                                      \
-    std::string why_unsupported;                                            \
-    if (!fake_device_supported(&why_unsupported)) {                         \
-      GTEST_SKIP() << why_unsupported;                                      \
-    }                                                                       \
+    if (std::string why; !fake_device_supported(&why)) GTEST_SKIP() << why; \
     ASSERT_EQ((device).setup_error(), "") << "fake device root not set up"; \
   } while (0)
-
-// Paths of the fake device.
-#define USERDATA_DEVICE "/dev/block/bootdevice/by-name/userdata"
-#define MISC_DEVICE "/dev/block/bootdevice/by-name/misc"
-
-// The build directory holding the programs under test.
-std::string build_dir();
-
-// Reads a whole host file, "" when absent.
-std::string read_host_file(const std::string& path);
-void write_host_file(const std::string& path, const std::string& content);
-
-// Little-endian helpers for checking raw bytes.
-uint32_t le32_at(const std::string& bytes, size_t offset);
-uint16_t le16_at(const std::string& bytes, size_t offset);
-uint64_t le64_at(const std::string& bytes, size_t offset);
