@@ -71,7 +71,9 @@ int write_contiguous_headers(int dev_fd, const int64_t* first, uint32_t n, uint3
         make_chain_block_header(static_cast<uint32_t>(first[k]), next, n, k, running_crc);
     encode_chain_block_header(h, buffer + static_cast<int64_t>(k) * block_size);
   }
-  return write_retry(dev_fd, buffer, static_cast<size_t>(n * block_size));
+  int rc = write_retry(dev_fd, buffer, static_cast<size_t>(n * block_size));
+  start_writeback(dev_fd, offset, n * block_size);
+  return rc;
 }
 
 void write_chain(int dev_fd, const int64_t* list, uint32_t count, uint8_t* buffer,
@@ -131,6 +133,7 @@ int raw_write_blocks(const char* block_file, const char* blk_dev, initial_block_
     RB_LOGE("failed to allocate block list\n");
     return -1;
   }
+  prefetch_block_map(fd);
   // The whole file is mapped before anything is written, so a file that cannot be mapped
   // leaves the device untouched.
   for (uint32_t i = 0; i < count; ++i) {

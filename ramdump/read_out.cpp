@@ -106,7 +106,9 @@ int raw_read_blocks(const char* block_file, const char* blk_dev, const char* out
 
   // Blocks are mapped ahead up to the end of their run; a block that cannot be mapped is
   // reported only after every block before it has been copied.
+  prefetch_block_map(in_fd);
   int result = 0;
+  off64_t out_offset = 0;
   int next_mapped = 0;
   bool next_known = false;
   for (uint32_t i = 0; i < count;) {
@@ -139,6 +141,8 @@ int raw_read_blocks(const char* block_file, const char* blk_dev, const char* out
       result = -1;
       break;
     }
+    start_writeback(out_fd, out_offset, n * block_size);
+    out_offset += n * block_size;
     i += n;
     if (unmappable) {
       RB_LOGE("failed to find block %d\n", static_cast<int>(i));

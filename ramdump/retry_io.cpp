@@ -1,6 +1,7 @@
 #include "ramdump/retry_io.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <string.h>
 #include <unistd.h>
 
@@ -42,4 +43,8 @@ off64_t seek_retry(int fd, off64_t offset) {
   while ((pos = lseek64(fd, offset, SEEK_SET)) < 0 && errno == EINTR) {
   }
   return pos;
+}
+
+void start_writeback(int fd, off64_t offset, off64_t length) {
+  sync_file_range(fd, offset, length, SYNC_FILE_RANGE_WRITE);
 }
