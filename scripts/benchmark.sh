@@ -9,7 +9,8 @@ if [ "$(id -u)" -ne 0 ]; then
   echo "benchmark.sh: run as root (loop devices, mounts, chroot)" >&2
   exit 1
 fi
-command -v strace >/dev/null || { apt-get update -qq && apt-get install -y -qq strace >/dev/null; }
+source scripts/install_missing.sh
+install_missing strace
 bash scripts/setup.sh build >/dev/null
 mkdir -p bench
 exec build/benchmark --out bench/results.md "$@"

@@ -5,18 +5,10 @@
 # tests/fuzz/regressions/<target>/, which the ordinary builds replay (commit it with the fix).
 set -euo pipefail
 cd "$(dirname "$0")/.."
+source scripts/install_missing.sh
 seconds=${RB_FUZZ_SECONDS:-60}
 
-missing=()
-for p in clang-14 libclang-rt-14-dev; do
-  dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")
-done
-if [ ${#missing[@]} -gt 0 ]; then
-  echo "installing: ${missing[*]}"
-  export DEBIAN_FRONTEND=noninteractive
-  apt-get update -qq
-  apt-get install -y -qq "${missing[@]}" >/dev/null
-fi
+install_missing clang-14 libclang-rt-14-dev
 start=$SECONDS
 CC=clang-14 CXX=clang++-14 cmake -S . -B build-fuzz -DCMAKE_BUILD_TYPE=RelWithDebInfo \
   -DRB_FUZZ=ON >/dev/null

@@ -4,6 +4,7 @@
 # arguments. Needs root for the package installation.
 set -euo pipefail
 cd "$(dirname "$0")/.."
+source scripts/install_missing.sh
 
 build_dir=${1:-build}
 shift || true
@@ -11,16 +12,7 @@ shift || true
 packages=(cmake g++ make pkg-config zlib1g-dev libgtest-dev googletest
   android-libbase-dev android-liblog-dev android-libcutils-dev
   e2fsprogs util-linux mount)
-missing=()
-for p in "${packages[@]}"; do
-  dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")
-done
-if [ ${#missing[@]} -gt 0 ]; then
-  echo "installing: ${missing[*]}"
-  export DEBIAN_FRONTEND=noninteractive
-  apt-get update -qq
-  apt-get install -y -qq "${missing[@]}" >/dev/null
-fi
+install_missing "${packages[@]}"
 
 cmake -S . -B "$build_dir" -DCMAKE_BUILD_TYPE=RelWithDebInfo "$@" >/dev/null
 cmake --build "$build_dir" -j"$(nproc)"

@@ -5,17 +5,13 @@
 # directory given (default: build). Run as root.
 set -euo pipefail
 cd "$(dirname "$0")/.."
+source scripts/install_missing.sh
 build_dir=${1:-build}
 if [ "$(id -u)" -ne 0 ]; then
   echo "valgrind: skipped, the fake device root needs root"
   exit 0
 fi
-if ! command -v valgrind >/dev/null; then
-  echo "installing: valgrind"
-  export DEBIAN_FRONTEND=noninteractive
-  apt-get update -qq
-  apt-get install -y -qq valgrind >/dev/null
-fi
+install_missing valgrind
 start=$SECONDS
 cmake --build "$build_dir" -j"$(nproc)" --target valgrind_paths >/dev/null
 "$build_dir/valgrind_paths"
