@@ -58,12 +58,13 @@ TEST(ChainWriter, KnownChains) {
   }
 }
 
-// 1025 consecutive blocks and a lone one: the run is cut after 1024 blocks, which changes
-// run_remaining only, never the links.
+// 1025 consecutive blocks, then blocks of which no two follow each other (descending by one
+// is not a run): the run is cut after 1024 blocks, which changes run_remaining only, never the
+// links, and every other block is a run of its own.
 TEST(ChainWriter, LongRunIsCut) {
   std::vector<int64_t> blocks;
   for (int64_t b = 100; b < 100 + 1025; ++b) blocks.push_back(b);
-  blocks.push_back(5000);
+  for (int64_t b : {5000, 4999, 3, 7}) blocks.push_back(b);
   auto got = arm(blocks, 0xDEADBEEF);
   for (size_t i = 0; i < blocks.size(); ++i) {
     chain_block_header h = decode_chain_block_header(reinterpret_cast<uint8_t*>(&got[i][0]));

@@ -4,6 +4,7 @@
 #include <android/log.h>
 #include <errno.h>
 #include <gtest/gtest.h>
+#include <string.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -73,6 +74,11 @@ std::string describe(const fstab* t) {
   for (const fstab_rec* r = t->recs; r < t->recs + t->num_entries; ++r) {
     char flags[64];
     snprintf(flags, sizeof(flags), " mf=0x%lx fmf=0x%x", r->mount_flags, r->fs_mgr_flags);
+    // The encryption bits themselves come back, not 1.
+    if (fs_mgr_is_encryptable(r) != 0) {
+      snprintf(flags + strlen(flags), sizeof(flags) - strlen(flags), " enc=0x%x",
+               fs_mgr_is_encryptable(r));
+    }
     s += std::string(r->mount_source ? r->mount_source : "-") + " " +
          (r->mount_point ? r->mount_point : "-") + " " + (r->fs_type ? r->fs_type : "-") + flags;
     const char* strings[] = {r->fs_options, r->key_location, r->key_directory, r->verify_value,
@@ -122,9 +128,9 @@ TEST_F(Fstab, OptionColumns) {
        "E [libfs_mgr]Unknown file contents encryption mode: foo\n"},
       {"defaults", "fileencryption=software:ice", "mf=0x0 fmf=0x2000 fc=1",
        "E [libfs_mgr]Unknown file names encryption mode: ice\n"},
-      {"defaults", "forcefdeorfbe=footer", "mf=0x0 fmf=0x10000 key=footer fc=1 fn=3"},
+      {"defaults", "forcefdeorfbe=footer", "mf=0x0 fmf=0x10000 enc=0x10000 key=footer fc=1 fn=3"},
       {"defaults", "encryptable=a,forceencrypt=b,keydirectory=/k",
-       "mf=0x0 fmf=0x4000404 key=b keydir=/k"},
+       "mf=0x0 fmf=0x4000404 enc=0x404 key=b keydir=/k"},
       {"defaults", "length=-0x10,swapprio=010,max_comp_streams=4294967298",
        "mf=0x0 fmf=0x1000a0 len=-16 prio=8 streams=2"},
       // "verifyatboot" must not be taken for "verify".
@@ -167,7 +173,7 @@ TEST_F(Fstab, WholeFiles) {
       // A carriage return stays on the last column: a trailing "wait" still matches by prefix,
       // a value keeps it.
       {"/a /b ext4 ro,x wait,encryptable=footer\r\n",
-       "/a /b ext4 mf=0x1 fmf=0x5 opts=x key=footer\r\n"},
+       "/a /b ext4 mf=0x1 fmf=0x5 enc=0x4 opts=x key=footer\r\n"},
       {"/a /b ext4 ro\n", "null", "E [libfs_mgr]Error parsing fs_mgr_options\n"},
       {"/a /b ext4 ro wait\n/a /b ext4\n", "null", "E [libfs_mgr]Error parsing mount_flags\n"},
       {"/a /b\n", "null", "E [libfs_mgr]Error parsing fs_type\n"},
@@ -177,7 +183,7 @@ TEST_F(Fstab, WholeFiles) {
        "E [libfs_mgr]Tried to process more entries than counted\n",
        "/a /b e ro wait\n/c /d e ro wait\n"},
       // Records counted but not found again stay zero-filled.
-      {"x\nx\n", "/a /b e mf=0x0 fmf=0x400 key=footer\n- - - mf=0x0 fmf=0x0 part=0 prio=0\n", "",
+      {"x\nx\n", "/a /b e mf=0x0 fmf=0x400 enc=0x400 key=footer\n- - - mf=0x0 fmf=0x0 part=0 prio=0\n", "",
        "/a /b e rw forceencrypt=footer\n"},
   };
   for (const auto& c : cases) {
