@@ -19,11 +19,9 @@
 // Caches are dropped before every timed step. Each figure is the median of the runs; the
 // system call counts come from one extra run of each operation under strace -c.
 #include <fcntl.h>
-#include <sched.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
-#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <sys/utsname.h>
@@ -222,10 +220,7 @@ int main(int argc, char** argv) {
     fprintf(stderr, "benchmark: %s\n", why.c_str());
     return 1;
   }
-  if (unshare(CLONE_NEWNS) != 0 || mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr)) {
-    perror("benchmark: private mount namespace");
-    return 1;
-  }
+  if (!enter_private_mount_namespace("benchmark: private mount namespace")) return 1;
   setvbuf(stdout, nullptr, _IOLBF, 0);
   FakeDeviceConfig config;
   config.data_bytes = 16ull << 30;

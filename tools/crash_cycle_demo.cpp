@@ -3,9 +3,7 @@
 // enable, first boot (create and arm the reserved area), a crash stored by the simulated
 // firmware, second boot (read-out, message extraction, re-arming) and a third boot. Shows the
 // properties, the stored initial block header, the files and the log after every step.
-#include <sched.h>
 #include <stdio.h>
-#include <sys/mount.h>
 #include <sys/stat.h>
 #include <time.h>
 #include <unistd.h>
@@ -102,11 +100,7 @@ int main() {
     fprintf(stderr, "crash_cycle_demo: %s\n", why.c_str());
     return 1;
   }
-  // Every mount of the demo stays inside this process and goes away with it.
-  if (unshare(CLONE_NEWNS) != 0 || mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr)) {
-    perror("crash_cycle_demo: private mount namespace");
-    return 1;
-  }
+  if (!enter_private_mount_namespace("crash_cycle_demo: private mount namespace")) return 1;
   setvbuf(stdout, nullptr, _IOLBF, 0);
   double start = now_seconds();
 

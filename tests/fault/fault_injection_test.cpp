@@ -144,14 +144,6 @@ void relink(FakeDevice& device, const std::vector<long>& chain, size_t index, ui
   device.write_raw(chain[index] * 4096ull, std::string(reinterpret_cast<char*>(header), 16));
 }
 
-std::string record(const std::string& name, uint64_t size, const std::string& content) {
-  dump_file_record r = {DUMP_FILE_MAGIC, {}, size, 0};
-  memcpy(r.name, name.data(), std::min(name.size(), DUMP_FILE_NAME_SIZE));
-  uint8_t header[DUMP_FILE_RECORD_SIZE];
-  encode_dump_file_record(r, header);
-  return std::string(reinterpret_cast<char*>(header), sizeof(header)) + content;
-}
-
 void set_misc_item(FakeDevice& device, size_t offset, const std::string& bytes) {
   write_host_file(device.misc_host_path(),
                   device.misc_bytes().replace(offset, bytes.size(), bytes));
@@ -281,11 +273,11 @@ std::vector<Case> cases() {
      {I("Found file 'RAMDUMP_MSG.txt', size 6")}, collected, kReserved,
      [](Context& c) {
        const std::string stream =
-           record("../../../../etc/pwn", 10, "0123456789") +
-           record("RAMDUMP_MSG.txt/../x", 5, "AAAAA") +  // 20 bytes, no terminator
-           record("/RAMDUMP_MSG.txt", 3, "BBB") + record("..", 2, "CC") +
-           record("RAMDUMP_MSG.txt", 6, "hello\n") +
-           record("../RAMDUMP_MSG.txt", UINT64_MAX, std::string(5000, 'Z'));
+           dump_record("../../../../etc/pwn", 10, "0123456789") +
+           dump_record("RAMDUMP_MSG.txt/../x", 5, "AAAAA") +  // 20 bytes, no terminator
+           dump_record("/RAMDUMP_MSG.txt", 3, "BBB") + dump_record("..", 2, "CC") +
+           dump_record("RAMDUMP_MSG.txt", 6, "hello\n") +
+           dump_record("../RAMDUMP_MSG.txt", UINT64_MAX, std::string(5000, 'Z'));
        for (size_t k = 0; k * 4080 < stream.size(); ++k) {
          c.device.write_raw(c.reserved[k] * 4096ull + 16, stream.substr(k * 4080, 4080));
        }

@@ -3,9 +3,7 @@
 // integrity test) and the boot entry collecting a stored dump and deleting a disabled one.
 // Fails on an unexpected exit status, any invalid access, and any leak but the memory the tool
 // keeps on purpose (valgrind.supp).
-#include <sched.h>
 #include <stdio.h>
-#include <sys/mount.h>
 #include <unistd.h>
 
 #include <string>
@@ -34,11 +32,12 @@ bool run(FakeDevice& device, const std::vector<std::string>& args,
 }  // namespace
 
 int main() {
-  if (geteuid() != 0 || unshare(CLONE_NEWNS) != 0 ||
-      mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
-    perror("valgrind_paths: a private mount namespace (needs root)");
+  std::string why;
+  if (!fake_device_supported(&why)) {
+    fprintf(stderr, "valgrind_paths: %s\n", why.c_str());
     return 1;
   }
+  if (!enter_private_mount_namespace("valgrind_paths: private mount namespace")) return 1;
   FakeDeviceConfig config;
   config.data_bytes = 16ull << 30;  // the boot entry wants 6 GiB free beside the reserved file
   config.cmdline = "console=ttyMSM0 androidboot.hardware=rbtest androidboot.android_dt_dir=/dt\n";

@@ -84,3 +84,10 @@ std::string make_ibh(uint32_t first_block, uint32_t block_size, uint32_t count, 
                      uint32_t state) {
   return "BHdr" + le32(first_block) + le32(block_size) + le32(count) + le32(crc) + le32(state);
 }
+
+std::string dump_record(const std::string& name, uint64_t size, const std::string& content) {
+  std::string field = name.substr(0, 20);
+  field.resize(20, '\0');
+  return "F1Le" + field + le32(static_cast<uint32_t>(size)) +
+         le32(static_cast<uint32_t>(size >> 32)) + le32(0x5555) + le32(0) + content;
+}

@@ -24,5 +24,10 @@ std::string tool_log(const FakeDevice& device);
 
 // The 24-byte initial block header item as stored in the misc image, and one built from fields.
 std::string stored_ibh(const FakeDevice& device);
+// A record of the dump stream as the firmware stores it: "F1Le", the name filling its 20-byte
+// field as it is (20 characters leave no terminator), the size, a reserved field that readers
+// ignore (set nonzero), then content, which may be shorter than size.
+std::string dump_record(const std::string& name, uint64_t size, const std::string& content);
+
 std::string make_ibh(uint32_t first_block, uint32_t block_size, uint32_t count, uint32_t crc,
                      uint32_t state);

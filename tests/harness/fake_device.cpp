@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <linux/loop.h>
+#include <sched.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <string.h>
@@ -85,6 +86,14 @@ bool fake_device_supported(std::string* why) {
   if (geteuid() == 0) return true;
   *why = "the fake device root needs root (mount namespaces, loop devices, chroot)";
   return false;
+}
+
+bool enter_private_mount_namespace(const char* who) {
+  if (unshare(CLONE_NEWNS) != 0 || mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr)) {
+    perror(who);
+    return false;
+  }
+  return true;
 }
 
 std::string read_host_file(const std::string& path) {

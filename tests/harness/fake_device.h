@@ -119,6 +119,10 @@ class FakeDevice {
 // Whether the harness can run here (root), and why not.
 bool fake_device_supported(std::string* why);
 
+// Moves the process into a private mount namespace, so that the mounts of its fake devices
+// never reach the host and vanish with it. False, after perror(who), when that fails.
+bool enter_private_mount_namespace(const char* who);
+
 // Replaces the process with a program of the root (path inside it) as run() does: under the
 // emulator named by RB_TEST_WRAPPER when that is set (scripts/test-aarch64.sh). Returns only on
 // failure.

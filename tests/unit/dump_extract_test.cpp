@@ -13,6 +13,7 @@
 
 #include "ramdump/chain_format.h"
 #include "ramdump/le_bytes.h"
+#include "tests/harness/chain_checks.h"
 
 namespace {
 
@@ -34,18 +35,8 @@ std::string pattern(size_t n, unsigned seed) {
   return s;
 }
 
-// A record of the dump stream. The name fills the 20-byte field as it is (20 characters leave
-// no terminator); the content may be shorter than size.
-std::string record(const std::string& name, uint64_t size, const std::string& content) {
-  dump_file_record r = {DUMP_FILE_MAGIC, {}, size, 0x5555};
-  memcpy(r.name, name.data(), std::min(name.size(), DUMP_FILE_NAME_SIZE));
-  uint8_t header[DUMP_FILE_RECORD_SIZE];
-  encode_dump_file_record(r, header);
-  return std::string(reinterpret_cast<char*>(header), sizeof(header)) + content;
-}
-
 std::string record(const std::string& name, const std::string& content) {
-  return record(name, content.size(), content);
+  return dump_record(name, content.size(), content);
 }
 
 // The stream as a read-out holds it: payloads behind chain block headers, the last one padded
@@ -125,8 +116,8 @@ TEST_F(DumpExtract, Endings) {
   const std::string empty_wanted = record("RAMDUMP_MSG.txt", "");
   const std::string filler = record("KLOG", pattern(kPayload - 80, 5));  // ends a payload
   const std::string tail = record("RAMDUMP_MSG.txt", "msg") + record("TZ", pattern(kPayload, 9));
-  const std::string huge = record("RAMDUMP_MSG.txt", 1ull << 40, "k") + tail;
-  const std::string huger = record("RAMDUMP_MSG.txt", ~0ull, "k") + tail;
+  const std::string huge = dump_record("RAMDUMP_MSG.txt", 1ull << 40, "k") + tail;
+  const std::string huger = dump_record("RAMDUMP_MSG.txt", ~0ull, "k") + tail;
   // The payloads after the first record header, which a record of a huge size takes.
   auto rest = [](const std::string& readout) {
     std::string payloads;
@@ -154,7 +145,7 @@ TEST_F(DumpExtract, Endings) {
        msg.substr(0, kPayload - 40), found + "6000\n"},
       // Sizes beyond the data: a record that is not wanted swallows everything after it, a wanted
       // one takes it all, also with a size past the signed range.
-      {"huge record before the wanted one", units(record("KLOG", 1ull << 40, "k") + tail), "",
+      {"huge record before the wanted one", units(dump_record("KLOG", 1ull << 40, "k") + tail), "",
        "(none)", ""},
       {"huge wanted record", units(huge), "", rest(units(huge)), found + "1099511627776\n"},
       {"wanted record past the signed range", units(huger), "", rest(units(huger)),
