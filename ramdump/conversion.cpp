@@ -10,7 +10,7 @@
 #include "platform/log.h"
 #include "ramdump/arming.h"
 #include "ramdump/block_device.h"
-#include "ramdump/integrity_test.h"
+#include "ramdump/chain_check.h"
 #include "ramdump/read_out.h"
 #include "ramdump/usage.h"
 

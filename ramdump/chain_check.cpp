@@ -1,4 +1,4 @@
-#include "ramdump/integrity_test.h"
+#include "ramdump/chain_check.h"
 
 #include <errno.h>
 #include <fcntl.h>
