@@ -133,10 +133,11 @@ void bounded_append(char* dst, size_t dst_size, const char* src) {
   dst[used + n] = '\0';
 }
 
-// A block size is only usable when it is a power of two of at least 4096 bytes.
-unsigned int usable_block_size(const char* value) {
+// A block size is only usable when it is a power of two of at least 4096 bytes; an unusable
+// one is dropped, so the field keeps what an earlier option of the line gave it.
+void set_block_size(unsigned int* field, const char* value) {
   unsigned int size = static_cast<unsigned int>(strtoul(value, nullptr, 0));
-  return size >= 4096 && (size & (size - 1)) == 0 ? size : 0;
+  if (size >= 4096 && (size & (size - 1)) == 0) *field = size;
 }
 
 uint64_t checked_mul(uint64_t a, uint64_t b) {
@@ -244,10 +245,10 @@ void extract_value(int flag, char* item, fs_mgr_flag_values* values) {
       break;
     }
     case MF_ERASEBLKSIZE:
-      values->erase_blk_size = usable_block_size(value);
+      set_block_size(&values->erase_blk_size, value);
       break;
     case MF_LOGICALBLKSIZE:
-      values->logical_blk_size = usable_block_size(value);
+      set_block_size(&values->logical_blk_size, value);
       break;
   }
 }

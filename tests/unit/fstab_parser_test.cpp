@@ -146,6 +146,8 @@ TEST_F(Fstab, OptionColumns) {
       {"defaults", "eraseblk=8192,logicalblk=0x1000",
        "mf=0x0 fmf=0x1800000 erase=8192 logical=4096"},
       {"defaults", "eraseblk=2048,logicalblk=6144", "mf=0x0 fmf=0x1800000"},
+      {"defaults", "eraseblk=8192,eraseblk=1000,logicalblk=4096,logicalblk=6144",
+       "mf=0x0 fmf=0x1800000 erase=8192 logical=4096"},
       {"defaults", "zramsize=0x1000", "mf=0x0 fmf=0x100 zram=4096"},
       {"defaults", "zramsize=4294967297", "mf=0x0 fmf=0x100 zram=1"},
       {"defaults", "zramsize=50%",
@@ -183,7 +185,8 @@ TEST_F(Fstab, WholeFiles) {
        "E [libfs_mgr]Tried to process more entries than counted\n",
        "/a /b e ro wait\n/c /d e ro wait\n"},
       // Records counted but not found again stay zero-filled.
-      {"x\nx\n", "/a /b e mf=0x0 fmf=0x400 enc=0x400 key=footer\n- - - mf=0x0 fmf=0x0 part=0 prio=0\n", "",
+      {"x\nx\n",
+       "/a /b e mf=0x0 fmf=0x400 enc=0x400 key=footer\n- - - mf=0x0 fmf=0x0 part=0 prio=0\n", "",
        "/a /b e rw forceencrypt=footer\n"},
   };
   for (const auto& c : cases) {
