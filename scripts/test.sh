@@ -3,7 +3,8 @@
 # with AddressSanitizer + UndefinedBehaviorSanitizer), fuzzes the parsers and the dump stream
 # filter for a bounded time (scripts/fuzz.sh), runs the main paths under valgrind
 # (scripts/valgrind.sh), tests the aarch64 build under emulation (scripts/test-aarch64.sh),
-# and runs CTest on both builds. The full-size crash cycle (4 GiB
+# checks the Android policy and build file (scripts/check-android.sh), and runs CTest on both
+# builds. The full-size crash cycle (4 GiB
 # written and read back) runs in the plain build only. Run as root: the device tests use loop
 # devices, mount namespaces and chroot (without root they are skipped).
 set -euo pipefail
@@ -33,6 +34,8 @@ bash scripts/fuzz.sh || status=1
 bash scripts/valgrind.sh build || status=1
 # The aarch64 build under qemu-user, and its bytes against the x86-64 build's.
 bash scripts/test-aarch64.sh || status=1
+# The SELinux policy compiled for user and userdebug builds, and Android.bp through bpfmt.
+bash scripts/check-android.sh || status=1
 run_ctest build-asan -E 'FullCrashCycleAtFullSize' || status=1
 run_ctest build || status=1
 
