@@ -2,9 +2,10 @@
 
 #include <android-base/file.h>
 #include <android-base/logging.h>
+#include <android-base/stringprintf.h>
 #include <android-base/strings.h>
-#include <stdio.h>
 #include <stdlib.h>
+#include <string.h>
 
 #include <mutex>
 #include <vector>
@@ -100,15 +101,11 @@ bool fs_mgr_update_for_slotselect(fstab* table) {
       suffix = fs_mgr_get_slot_suffix();
       if (suffix.empty()) return false;
     }
-    char* with_suffix = nullptr;
-    int len = asprintf(&with_suffix, "%s%s", rec->mount_source != nullptr ? rec->mount_source : "",
-                       suffix.c_str());
-    if (len < 1) {
-      if (len == 0) free(with_suffix);
-      return false;
-    }
+    // The suffix is not empty, so neither is the result; the record keeps a heap string.
+    const std::string with_suffix = android::base::StringPrintf(
+        "%s%s", rec->mount_source != nullptr ? rec->mount_source : "", suffix.c_str());
     free(rec->mount_source);
-    rec->mount_source = with_suffix;
+    rec->mount_source = strdup(with_suffix.c_str());
   }
   return true;
 }

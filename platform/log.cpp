@@ -1,24 +1,31 @@
 #include "platform/log.h"
 
 #include <android-base/logging.h>
+
+#ifndef __BIONIC__
+#include <android-base/file.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <unistd.h>
 
 #include <string>
 
-#include "platform/write_all.h"
-
-#ifndef __BIONIC__
 namespace {
-
-int host_log_fd = -2;  // -2: not opened yet, -1: unavailable, use standard error
 
 char priority_letter(int priority) {
   static const char kLetters[] = "??VDIWEF";
   return priority >= 0 && priority < 8 ? kLetters[priority] : '?';
 }
 
+// The log file only where it exists: creating it would leave a world-writable file in a build
+// host's real /dev. It stays open for the process's lifetime.
+int host_log_fd() {
+  static const int fd = TEMP_FAILURE_RETRY(open(RB_HOST_LOG_PATH, O_WRONLY | O_APPEND | O_CLOEXEC));
+  return fd >= 0 ? fd : STDERR_FILENO;
+}
+
+// Not liblog's own stderr logger: it puts the source file and line in front of libbase's
+// records and leaves an empty line after every message that ends in a line feed.
 void host_log_writer(const struct __android_logger_data* data, const char* message) {
   int saved_errno = errno;
   std::string line;
@@ -36,12 +43,8 @@ void host_log_writer(const struct __android_logger_data* data, const char* messa
     }
   }
   line += '\n';
-  if (host_log_fd == -2) {
-    host_log_fd = open(RB_HOST_LOG_PATH, O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0666);
-  }
-  int fd = host_log_fd >= 0 ? host_log_fd : STDERR_FILENO;
   // A record is one write with O_APPEND, so records of concurrent writers stay whole.
-  write_all(fd, line.data(), line.size());
+  android::base::WriteFully(host_log_fd(), line.data(), line.size());
   errno = saved_errno;
 }
 

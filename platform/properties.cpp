@@ -8,14 +8,14 @@ std::string platform_get_property(const std::string& key, const std::string& def
 }
 
 #else
-#include <errno.h>
-#include <fcntl.h>
+#include <android-base/file.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "platform/write_all.h"
+#include <algorithm>
 
 namespace {
 
@@ -27,21 +27,16 @@ bool valid_key(const char* key) {
 std::string property_path(const char* key) { return std::string(RB_HOST_PROPERTY_DIR "/") + key; }
 
 // The value as the property service would hold it: at most PROPERTY_VALUE_MAX - 1 bytes,
-// up to the first NUL.
+// up to the first NUL. Without the directory (a build host outside a fake device root) every
+// property reads as empty.
 std::string read_property(const char* key) {
-  if (!valid_key(key)) return "";
-  int fd = open(property_path(key).c_str(), O_RDONLY | O_CLOEXEC);
-  if (fd < 0) return "";
-  char buf[PROPERTY_VALUE_MAX];
-  size_t got = 0;
-  while (got < sizeof(buf) - 1) {
-    ssize_t n = read(fd, buf + got, sizeof(buf) - 1 - got);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) break;
-    got += static_cast<size_t>(n);
+  std::string value;
+  if (!valid_key(key) ||
+      !android::base::ReadFileToString(property_path(key), &value, /*follow_symlinks=*/true)) {
+    return "";
   }
-  close(fd);
-  return std::string(buf, strnlen(buf, got));
+  value.resize(strnlen(value.c_str(), std::min(value.size(), size_t{PROPERTY_VALUE_MAX - 1})));
+  return value;
 }
 
 }  // namespace
@@ -58,15 +53,16 @@ extern "C" int property_get(const char* key, char* value, const char* default_va
 
 extern "C" int property_set(const char* key, const char* value) {
   if (!valid_key(key) || value == nullptr || strlen(value) >= PROPERTY_VALUE_MAX) return -1;
-  mkdir(RB_HOST_PROPERTY_DIR, 0755);
-  // Readers see either the old or the new value, never a partial one.
+  // Readers see either the old or the new value, never a partial one. Without the directory
+  // the set fails: nothing is created in a build host's /dev.
   std::string final_path = property_path(key);
   std::string tmp_path = std::string(RB_HOST_PROPERTY_DIR "/.") + key + ".XXXXXX";
   int fd = mkstemp(&tmp_path[0]);
   if (fd < 0) return -1;
-  size_t len = strlen(value);
-  bool ok = write_all(fd, value, len);
+  bool ok = android::base::WriteFully(fd, value, strlen(value));
   ok = fchmod(fd, 0644) == 0 && ok;
+  // Not a unique_fd: the result of close counts, a value that did not reach the file is not
+  // renamed into place.
   ok = close(fd) == 0 && ok;
   if (!ok || rename(tmp_path.c_str(), final_path.c_str()) != 0) {
     unlink(tmp_path.c_str());

@@ -1,8 +1,9 @@
 // System properties. On Android these are the property service's calls from libcutils and
 // libbase; on a build host, which has no property service, properties.cpp supplies the same
 // calls over one file per property in RB_HOST_PROPERTY_DIR (the file's content is the value;
-// an absent or unreadable file reads as empty). Every property access of the tool goes
-// through this header.
+// an absent or unreadable file reads as empty). The directory is never created: where it does
+// not exist (a build host outside a fake device root) every get reads empty and every set
+// fails. Every property access of the tool goes through this header.
 #pragma once
 
 #include <string>

@@ -45,9 +45,10 @@ make_root() {
   mount -o remount,bind,ro "$root/usr"
   for link in bin lib lib64; do [ -e /usr/$link ] && ln -s usr/$link "$root/$link"; done
   mount -t proc proc "$root/proc"
-  echo "console=ttyMSM0 androidboot.hardware=rbtest" >"$root/tmp/cmdline"
+  echo "console=ttyS0 androidboot.hardware=rbtest" >"$root/tmp/cmdline"
   mount --bind "$root/tmp/cmdline" "$root/proc/cmdline"
   mknod "$root/dev/null" c 1 3
+  : >"$root/dev/__log__" # the programs append to it only where it exists
   head -c 1048576 /dev/zero >"$root/dev/block/bootdevice/by-name/misc"
   echo "/dev/block/bootdevice/by-name/userdata /data ext4 noatime,nosuid,nodev,barrier=1" \
     "wait,check,encryptable=footer" >"$root/vendor/etc/fstab.rbtest"
@@ -112,12 +113,13 @@ run_sequence() {
   } | dd of="$root/dev/block/bootdevice/by-name/misc" bs=1 seek=3184 conv=notrunc status=none
 
   # The crash: the x86-64 firmware simulator stores three files as the dump.
-  head -c 9000 /dev/zero | tr '\0' '\021' >"$root/tmp/dmesg.bin"
+  head -c 9000 /dev/zero | tr '\0' '\021' >"$root/tmp/kernel_log.bin"
   for i in $(seq 1 40); do echo "[$i] Kernel panic - not syncing: simulated"; done \
     >"$root/tmp/RAMDUMP_MSG.txt"
-  seq 1 20000 >"$root/tmp/ddr.bin"
+  seq 1 20000 >"$root/tmp/memory0.bin"
   run_in_root firmware_sim /dev/block/bootdevice/by-name/misc \
-    /dev/block/bootdevice/by-name/userdata /tmp/dmesg.bin /tmp/RAMDUMP_MSG.txt /tmp/ddr.bin
+    /dev/block/bootdevice/by-name/userdata /tmp/kernel_log.bin /tmp/RAMDUMP_MSG.txt \
+    /tmp/memory0.bin
 
   run_in_root reserveblocks -a -i 1
   run_in_root reserveblocks -t -i $CRC $RESERVED

@@ -1,8 +1,6 @@
 // fstab_dump: prints a mount table as the reader parsed it, one field per line, so that the
-// parser and the default table selection can be checked from outside the process.
-//
-//   fstab_dump FILE       the table in FILE (fs_mgr_read_fstab)
-//   fstab_dump --default  the device's default table (fs_mgr_read_fstab_default)
+// parser, the default table selection and the block device lookup can be checked from outside
+// the process. The usage text below lists the forms.
 #include <inttypes.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -13,6 +11,7 @@
 
 #include "fs_mgr/fs_mgr_fstab.h"
 #include "platform/log.h"
+#include "ramdump/block_device.h"
 
 namespace {
 
@@ -58,29 +57,84 @@ void print_record(int i, const fstab_rec& r) {
   printf("rec[%d].logical_blk_size=%u\n", i, r.logical_blk_size);
 }
 
+const char kUsage[] =
+    "usage: fstab_dump FILE | fstab_dump --default | fstab_dump --find PATH\n"
+    "Shows how reserveblocks reads a mount table: every record and field, one per line.\n"
+    "  FILE         the table in FILE\n"
+    "  --default    the device's default table: the device tree's records, then those of the\n"
+    "               first of /odm/etc/fstab.<hardware>, /vendor/etc/fstab.<hardware> and\n"
+    "               /fstab.<hardware> (/etc/recovery.fstab in recovery)\n"
+    "  --find PATH  the record of the default table whose device the tool uses for PATH\n"
+    "               (absolute, links resolved; the first record whose mount point holds it),\n"
+    "               with whether it may be encrypted and whether it is\n"
+    "  --help       this text\n"
+    "The default table's paths are fixed: run it in a fake device root or on a device. The\n"
+    "reader's messages go to /dev/__log__ where that file exists, else to standard error.\n";
+
+int usage_error() {
+  fputs(kUsage, stderr);
+  return 2;
+}
+
+// The record that find_block_device chose: the one whose mount_source it returned.
+int record_index(const fstab* table, const char* blk_dev) {
+  for (int i = 0; i < table->num_entries; ++i) {
+    if (table->recs[i].mount_source == blk_dev) return i;
+  }
+  return -1;
+}
+
+// The table's release leaves verify_value allocated, so the tool frees those itself.
+void release(fstab* table) {
+  std::vector<char*> verify_values;
+  for (int i = 0; i < table->num_entries; ++i) verify_values.push_back(table->recs[i].verify_value);
+  fs_mgr_free_fstab(table);
+  for (char* value : verify_values) free(value);
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
   platform_init_logging();
-  if (argc != 2 || (argv[1][0] == '-' && argv[1][1] != '\0' && strcmp(argv[1], "--default"))) {
-    fprintf(stderr, "usage: fstab_dump FILE | fstab_dump --default\n");
-    return 2;
+  const bool find = argc == 3 && strcmp(argv[1], "--find") == 0;
+  if (argc == 2 && strcmp(argv[1], "--help") == 0) {
+    fputs(kUsage, stdout);
+    return 0;
   }
-  fstab* table =
-      strcmp(argv[1], "--default") == 0 ? fs_mgr_read_fstab_default() : fs_mgr_read_fstab(argv[1]);
+  if (find ? argv[2][0] != '/'
+           : argc != 2 ||
+                 (argv[1][0] == '-' && argv[1][1] != '\0' && strcmp(argv[1], "--default") != 0)) {
+    return usage_error();
+  }
+  const bool from_file = !find && strcmp(argv[1], "--default") != 0;
+  fstab* table = from_file ? fs_mgr_read_fstab(argv[1]) : fs_mgr_read_fstab_default();
   if (table == nullptr) {
     printf("NULL TABLE\n");
+    if (from_file) {
+      fprintf(stderr, "fstab_dump: %s: no mount table read (the reasons are logged)\n", argv[1]);
+    } else {
+      fprintf(stderr, "fstab_dump: no default mount table read (the reasons are logged)\n");
+    }
     return 1;
   }
-  printf("num_entries=%d\n", table->num_entries);
-  printf("fstab_filename=%s\n", quoted(table->fstab_filename).c_str());
-  std::vector<char*> verify_values;
-  for (int i = 0; i < table->num_entries; ++i) {
-    print_record(i, table->recs[i]);
-    verify_values.push_back(table->recs[i].verify_value);
+  int status = 0;
+  if (find) {
+    int encryptable = 0, encrypted = 0;
+    const char* blk_dev = find_block_device(argv[2], table, &encryptable, &encrypted);
+    if (blk_dev == nullptr) {
+      fprintf(stderr, "fstab_dump: %s: no record of the default mount table holds it\n", argv[2]);
+      status = 1;
+    } else {
+      const int i = record_index(table, blk_dev);
+      printf("record=%d\nblock_device=%s\nencryptable=%d\nencrypted=%d\n", i,
+             quoted(blk_dev).c_str(), encryptable, encrypted);
+      print_record(i, table->recs[i]);
+    }
+  } else {
+    printf("num_entries=%d\n", table->num_entries);
+    printf("fstab_filename=%s\n", quoted(table->fstab_filename).c_str());
+    for (int i = 0; i < table->num_entries; ++i) print_record(i, table->recs[i]);
   }
-  // The table's release leaves verify_value allocated, so the tool frees those itself.
-  fs_mgr_free_fstab(table);
-  for (char* value : verify_values) free(value);
-  return 0;
+  release(table);
+  return status;
 }

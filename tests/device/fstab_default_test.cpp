@@ -1,6 +1,7 @@
 // The default mount table inside the fake device root: which table file is chosen, the
 // device-tree table merged in front of it, slot suffixes, boot settings from properties, the
-// kernel command line and the device tree, and the encryption state of a block device.
+// kernel command line and the device tree, and the block device lookup with its encryption
+// state.
 #include <gtest/gtest.h>
 
 #include <filesystem>
@@ -9,8 +10,6 @@
 #include <vector>
 
 #include "fs_mgr/fs_mgr_boot_config.h"
-#include "platform/log.h"
-#include "ramdump/block_device.h"
 #include "tests/harness/fake_device.h"
 
 namespace {
@@ -181,30 +180,28 @@ TEST(BootConfig, CommandLineDeviceTreeAndSlot) {
             "compatible=0\ncompatible=0\n");
 }
 
-TEST(BlockDevice, EncryptionState) {
+// fstab_dump --find: the tool's lookup in the default table. Only an encryptable record on a
+// device whose state reads exactly "encrypted" is encrypted.
+TEST(BlockDevice, FindAndEncryptionState) {
   FakeDeviceConfig config;
   config.fstab =
       "/dev/block/userdata /data ext4 rw wait,forcefdeorfbe=footer\n"
       "/dev/block/cache /cache ext4 rw wait\n";
   FakeDevice device(config);
   REQUIRE_DEVICE(device);
-  // Only an encryptable record on a device whose state reads exactly "encrypted" is encrypted.
-  for (const char* state : {"", "encrypted", "unencrypted", "encrypted "}) {
+  for (const std::string state : {"", "encrypted", "unencrypted", "encrypted "}) {
     device.set_property("ro.crypto.state", state);
-    RunResult r = device.run_in_root([] {
-      platform_init_logging();
-      fstab* table = fs_mgr_read_fstab_default();
-      for (const char* path : {"/data/vendor/ramdump/RAMDUMP_RESERVED", "/cache/x"}) {
-        int encryptable = -1, encrypted = -1;
-        const char* dev = find_block_device(path, table, &encryptable, &encrypted);
-        printf("%s %d %d\n", dev != nullptr ? dev : "null", encryptable, encrypted);
-      }
-      fs_mgr_free_fstab(table);
-      return 0;
-    });
-    EXPECT_EQ(r.out, std::string("/dev/block/userdata 1 ") +
-                         (state == std::string("encrypted") ? "1" : "0") +
-                         "\n/dev/block/cache 0 0\n")
+    std::string found;
+    for (const char* path : {"/data/vendor/ramdump/RAMDUMP_RESERVED", "/cache/x", "/system/x"}) {
+      RunResult r = device.run({"--find", path}, "fstab_dump");
+      found += std::to_string(r.status);
+      for (const char* name : {"record", "block_device", "encryptable", "encrypted"})
+        found += " " + field(r.out, name);
+      found += "\n";
+    }
+    EXPECT_EQ(found, "0 0 \"/dev/block/userdata\" 1 " +
+                         std::string(state == "encrypted" ? "1" : "0") +
+                         "\n0 1 \"/dev/block/cache\" 0 0\n1 <none> <none> <none> <none>\n")
         << state;
   }
 }

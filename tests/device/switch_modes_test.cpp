@@ -76,6 +76,33 @@ TEST(SwitchModes, CommandLinesAndTheItemsEachModeWrites) {
   }
 }
 
+// A build host has no log daemon or property service: the log file and the property directory
+// are used only where they exist (the fake root has both). Without them the messages go to
+// standard error, a property cannot be set, and nothing is created in /dev.
+TEST(SwitchModes, HostWithoutLogFileOrPropertyDirectory) {
+  FakeDevice device(misc_config(0, false, true));
+  REQUIRE_DEVICE(device);
+  write_host_file(device.misc_host_path(), patched(device.misc_bytes(), 3216, "DiSa"));
+  device.remove("/dev/__log__");
+  device.remove("/dev/__properties__");
+  RunResult boot = device.run({"-a"}), dump = device.run({"/nonexistent"}, "fstab_dump");
+  EXPECT_EQ(boot.status, 255);
+  EXPECT_EQ(boot.err,
+            "I reserveblocks: Ramdump is disabled, deleting ramdump reserved file: "
+            "/data/vendor/ramdump/RAMDUMP_RESERVED\\n\n"
+            "E reserveblocks: Failed to delete /data/vendor/ramdump/RAMDUMP_RESERVED: No such file "
+            "or directory\\n\n"
+            "I reserveblocks: Ramdump is disabled, deleting ramdump output file: "
+            "/data/vendor/ramdump/apq/00/RAMDUMP_OUTPUT\\n\n");
+  EXPECT_EQ(dump.status, 1);
+  EXPECT_EQ(dump.err,
+            "E fstab_dump: [libfs_mgr]fs_mgr_read_fstab(): cannot open file: '/nonexistent': No "
+            "such file or directory\nfstab_dump: /nonexistent: no mount table read (the reasons "
+            "are logged)\n");
+  EXPECT_FALSE(device.exists("/dev/__log__"));
+  EXPECT_FALSE(device.exists("/dev/__properties__"));
+}
+
 TEST(MiscStore, MissingPartitionAndBadItems) {
   FakeDevice device(misc_config(0, false, false));
   REQUIRE_DEVICE(device);

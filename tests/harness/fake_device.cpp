@@ -158,6 +158,7 @@ void FakeDevice::setup(const FakeDeviceConfig& config) {
                   nullptr) == 0,
         "mount /proc with a fixture /proc/cmdline");
   check(mknod(host_path("/dev/null").c_str(), S_IFCHR | 0666, makedev(1, 3)) == 0, "/dev/null");
+  clear_log();
   const std::string misc(1 << 20, static_cast<char>(config.misc_fill));
   if (config.misc_primary) write_host_file(misc_host_path(true), misc);
   if (config.misc_secondary) write_host_file(misc_host_path(false), misc);

@@ -32,7 +32,7 @@ struct FakeDeviceConfig {
   bool misc_primary = false;   // a 1 MiB image at /dev/block/platform/msm_sdcc.1/by-name/misc
   bool misc_secondary = true;  // a 1 MiB image at /dev/block/bootdevice/by-name/misc
   uint8_t misc_fill = 0;
-  std::string cmdline = "console=ttyMSM0 androidboot.hardware=rbtest\n";
+  std::string cmdline = "console=ttyS0 androidboot.hardware=rbtest\n";
   uint64_t data_bytes;       // nonzero: /data is a (sparse) ext4 image of this size
   std::string mkfs_options;  // extra options for mkfs.ext4
   std::string fstab =        // /vendor/etc/fstab.rbtest
@@ -70,9 +70,10 @@ class FakeDevice {
   std::string property(const std::string& name) const {  // absent reads as ""
     return read_file("/dev/__properties__/" + name);
   }
-  // The system log, one record per line (platform/log.h).
+  // The system log, one record per line (platform/log.h). The root has the log file, as a
+  // phone has its log daemon; the programs only append to it.
   std::string log() const { return read_file("/dev/__log__"); }
-  void clear_log() { remove("/dev/__log__"); }
+  void clear_log() { write_file("/dev/__log__", "", 0666); }
 
   // Runs /system/bin/<program> chrooted into the root (argv[0] = program); a run longer than
   // timeout_seconds is killed.
