@@ -1,0 +1,164 @@
+#include "tools/ramdump_inspect/readout_reader.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "ramdump/le_bytes.h"
+
+namespace {
+
+constexpr size_t kReadSize = READ_UNITS * UNIT_SIZE;
+
+std::string hex32(uint32_t v) {
+  char text[16];
+  snprintf(text, sizeof(text), "%08x", v);
+  return text;
+}
+
+}  // namespace
+
+int readout_open(readout_reader* r, const char* path, const char* what) {
+  r->path = path;
+  r->fd = open(path, O_RDONLY | O_CLOEXEC);
+  if (r->fd < 0) return fail(path, strerror(errno));
+  struct stat st;
+  if (fstat(r->fd, &st) != 0 || S_ISDIR(st.st_mode)) {
+    const std::string why = S_ISDIR(st.st_mode) ? "is a directory" : strerror(errno);
+    close(r->fd);
+    r->fd = -1;
+    fail(path, why);
+    return -1;
+  }
+  // A regular file's partial last unit is reported even when the reading stops before it.
+  if (S_ISREG(st.st_mode)) {
+    r->size = static_cast<uint64_t>(st.st_size);
+    r->partial = r->size % UNIT_SIZE;
+    r->partial_offset = r->size - r->partial;
+  }
+  posix_fadvise(r->fd, 0, 0, POSIX_FADV_SEQUENTIAL);
+  if (posix_memalign(reinterpret_cast<void**>(&r->buffer), UNIT_SIZE, kReadSize) != 0) {
+    close(r->fd);
+    r->fd = -1;
+    fail(path, "out of memory");
+    return -1;
+  }
+  r->prog = progress_begin(what, r->size);
+  return 0;
+}
+
+size_t readout_next(readout_reader* r, const uint8_t** units) {
+  if (r->done) return 0;
+  size_t have = 0;
+  while (have < kReadSize) {
+    ssize_t n = read(r->fd, r->buffer + have, kReadSize - have);
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) {
+      r->read_errno = errno;
+      r->done = true;
+      break;
+    }
+    if (n == 0) {
+      r->done = true;
+      break;
+    }
+    have += static_cast<size_t>(n);
+  }
+  const uint64_t start = r->offset;
+  r->offset += have;
+  progress_update(&r->prog, r->offset);
+  size_t count = have / UNIT_SIZE;
+  if (r->done && r->read_errno == 0 && have % UNIT_SIZE != 0) {
+    r->partial = have % UNIT_SIZE;
+    r->partial_offset = r->offset - r->partial;
+  }
+  for (size_t i = 0; i < count; ++i) {
+    const uint32_t magic = get_le32(r->buffer + i * UNIT_SIZE);
+    if (magic != CHAIN_BLOCK_MAGIC) {
+      r->bad_chain_magic = true;
+      r->chain_magic = magic;
+      r->offset = start + i * UNIT_SIZE;
+      r->done = true;
+      count = i;
+      break;
+    }
+  }
+  r->units += count;
+  *units = r->buffer;
+  return count;
+}
+
+std::string readout_stop_text(const readout_reader& r) {
+  if (r.bad_chain_magic) {
+    return "unit " + std::to_string(r.units) + " at offset " + std::to_string(r.offset) +
+           " has chain block magic " + hex32(r.chain_magic) + ", not " + hex32(CHAIN_BLOCK_MAGIC) +
+           " (\"BCho\")";
+  }
+  if (r.read_errno != 0) {
+    return "read failed near offset " + std::to_string(r.offset) + ": " + strerror(r.read_errno);
+  }
+  return "";
+}
+
+int readout_close(readout_reader* r) {
+  progress_end(&r->prog);
+  if (r->partial > 0) {
+    fail(r->path, "ends in a partial unit of " + std::to_string(r->partial) + " bytes at offset " +
+                      std::to_string(r->partial_offset) +
+                      " (not a multiple of 4096 bytes), ignored");
+  }
+  const std::string stop = readout_stop_text(*r);
+  if (!stop.empty()) fail(r->path, stop + (r->bad_chain_magic ? ": the data ends there" : ""));
+  if (r->fd >= 0) close(r->fd);
+  free(r->buffer);
+  r->fd = -1;
+  r->buffer = nullptr;
+  return readout_damaged(*r) ? kExitBad : kExitOk;
+}
+
+int readout_parse(readout_reader* r, dump_stream* s, const dump_stream_sink& sink,
+                  device_extraction* device, int (*chunk_end)(void* ctx)) {
+  const uint8_t* units;
+  for (size_t count; (count = readout_next(r, &units)) > 0;) {
+    for (size_t i = 0; i < count; ++i) {
+      const uint8_t* unit = units + i * UNIT_SIZE;
+      int rc = dump_stream_feed(s, unit + CHAIN_BLOCK_HEADER_SIZE, UNIT_PAYLOAD_SIZE, sink);
+      if (rc < 0) return rc;
+      if (device != nullptr) device_extraction_feed(device, unit);
+    }
+    if (chunk_end != nullptr) {
+      int rc = chunk_end(sink.ctx);
+      if (rc < 0) return rc;
+    }
+    // What follows the stream's end matters to neither.
+    if (dump_stream_ended(*s) && (device == nullptr || device->stopped)) break;
+  }
+  return dump_stream_finish(s, sink);
+}
+
+int write_pieces(int fd, iovec* pieces, size_t count) {
+  while (count > 0) {
+    ssize_t n = writev(fd, pieces, static_cast<int>(count));
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) {
+      if (n == 0) errno = EIO;
+      return -1;
+    }
+    for (size_t done = static_cast<size_t>(n); done > 0;) {
+      if (done >= pieces->iov_len) {
+        done -= pieces->iov_len;
+        ++pieces;
+        --count;
+      } else {
+        pieces->iov_base = static_cast<uint8_t*>(pieces->iov_base) + done;
+        pieces->iov_len -= done;
+        done = 0;
+      }
+    }
+  }
+  return 0;
+}
