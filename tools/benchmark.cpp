@@ -191,9 +191,9 @@ void store_dump(FakeDevice& device, const RunResult& armed) {
   misc.replace(3216, 4, "EnAb");
   write_host_file(device.misc_host_path(), misc);
   device.write_file("/tmp/RAMDUMP_MSG.txt", "benchmark crash\n");
-  device.write_file("/tmp/DDRCS0.BIN", std::string(1 << 20, 'd'));
+  device.write_file("/tmp/memory0.bin", std::string(1 << 20, 'd'));
   RunResult r = device.run(
-      {MISC_DEVICE, USERDATA_DEVICE, "/tmp/RAMDUMP_MSG.txt", "/tmp/DDRCS0.BIN"}, "firmware_sim");
+      {MISC_DEVICE, USERDATA_DEVICE, "/tmp/RAMDUMP_MSG.txt", "/tmp/memory0.bin"}, "firmware_sim");
   if (r.status != 0) {
     fprintf(stderr, "benchmark: firmware_sim failed: %s", r.err.c_str());
     exit(1);

@@ -148,15 +148,15 @@ int main() {
   std::string message =
       "Kernel panic - not syncing: Fatal exception in interrupt\n"
       "CPU: 3 PID: 0 Comm: swapper/3 Tainted: G W\n"
-      "Call trace:\n  msm_watchdog_bark+0x28/0x40\n  handle_irq+0x48/0x80\n";
-  device.write_file("/tmp/dmesg_TZ.bin", std::string(200000, 't'));
+      "Call trace:\n  watchdog_timer_fn+0x28/0x40\n  handle_irq+0x48/0x80\n";
+  device.write_file("/tmp/kernel_log.bin", std::string(200000, 't'));
   device.write_file("/tmp/RAMDUMP_MSG.txt", message);
-  std::string ddr(8 << 20, '\0');
-  for (size_t i = 0; i < ddr.size(); ++i) ddr[i] = static_cast<char>(i * 31 + (i >> 10));
-  device.write_file("/tmp/DDRCS0.BIN", ddr);
+  std::string memory(8 << 20, '\0');
+  for (size_t i = 0; i < memory.size(); ++i) memory[i] = static_cast<char>(i * 31 + (i >> 10));
+  device.write_file("/tmp/memory0.bin", memory);
   if (!run_step(device, "Firmware stores three files",
-                {MISC_DEVICE, USERDATA_DEVICE, "/tmp/dmesg_TZ.bin", "/tmp/RAMDUMP_MSG.txt",
-                 "/tmp/DDRCS0.BIN"},
+                {MISC_DEVICE, USERDATA_DEVICE, "/tmp/kernel_log.bin", "/tmp/RAMDUMP_MSG.txt",
+                 "/tmp/memory0.bin"},
                 "firmware_sim")) {
     return 1;
   }

@@ -165,9 +165,9 @@ TEST(AutoCycle, SpaceThresholdsAndUnusableReservedFile) {
 TEST(AutoCycle, StateWordAndReadOutOfASmallChain) {
   FakeDevice device(16 * kGiB);
   REQUIRE_DEVICE(device);
-  const Files files = {{"/tmp/tz.bin", std::string(5000, '\x01')},
-                       {"/tmp/RAMDUMP_MSG.txt", "watchdog bite on cpu 3\n"},
-                       {"/tmp/ocimem.bin", std::string(100000, '\x02')}};
+  const Files files = {{"/tmp/firmware_log.bin", std::string(5000, '\x01')},
+                       {"/tmp/RAMDUMP_MSG.txt", "watchdog timeout on cpu 3\n"},
+                       {"/tmp/memory1.bin", std::string(100000, '\x02')}};
   const uint32_t count = 64;
   const struct {
     uint32_t state, stored;
@@ -193,7 +193,7 @@ TEST(AutoCycle, StateWordAndReadOutOfASmallChain) {
     // Only the message file is extracted (its record follows another one in the stream).
     EXPECT_EQ(std::filesystem::file_size(device.host_path(kOutput)), count * 4096u);
     EXPECT_EQ(device.read_file(kMessage), files[1].second);
-    EXPECT_FALSE(device.exists(std::string(kOutDir) + "/tz.bin"));
+    EXPECT_FALSE(device.exists(std::string(kOutDir) + "/firmware_log.bin"));
     EXPECT_EQ(mode_of(device, kOutDir), 0777u);
     EXPECT_EQ(mode_of(device, "/data/vendor/ramdump/apq"), 0777u);
     EXPECT_EQ(mode_of(device, kOutput), 0666u);
@@ -225,9 +225,9 @@ TEST(AutoCycle, FullCrashCycleAtFullSize) {
   for (int i = 0; i < 500; ++i) message += "[" + std::to_string(i) + "] call trace line\n";
   std::string big(3 << 20, '\0');
   for (size_t i = 0; i < big.size(); ++i) big[i] = static_cast<char>(i * 7 + (i >> 12));
-  const Files files = {{"/tmp/dmesg_tz.bin", std::string(12345, 't')},
+  const Files files = {{"/tmp/kernel_log.bin", std::string(12345, 't')},
                        {"/tmp/RAMDUMP_MSG.txt", message},
-                       {"/tmp/DDRCS0.BIN", big}};
+                       {"/tmp/memory0.bin", big}};
   simulate_crash(device, files);
   EXPECT_EQ(stored_ibh(device), make_ibh(blocks[0], 4096, kCount, 0x1234abcd, 3));
   // The chain blocks as the firmware left them, for the output of the read-out.

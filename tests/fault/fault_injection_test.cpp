@@ -35,7 +35,7 @@ const char kTrace[] = "/tmp/fault-trace";
 const uint32_t kArmedCount = 1100;  // blocks of kArmed: at least two runs
 const uint32_t kCount = 64;         // blocks of the reserved file
 const uint32_t kCrc = 0x5eed;
-const char kMsgText[] = "watchdog bite on cpu 3\n";
+const char kMsgText[] = "watchdog timeout on cpu 3\n";
 
 // Before every row: kArmed armed with kCrc, and the feature enabled with the reserved file
 // holding a dump the firmware stored, its header in the misc partition.
@@ -171,9 +171,9 @@ void prepare(Context& c) {
   d.set_property("debug.kvo.kvdump", "");
   d.set_property("debug.kvo.ramdump_new_directory", "");
   d.write_file("/tmp/RAMDUMP_MSG.txt", kMsgText);
-  d.write_file("/tmp/ddr.bin", std::string(9000, '\x22'));
-  RunResult r =
-      d.run({MISC_DEVICE, USERDATA_DEVICE, "/tmp/ddr.bin", "/tmp/RAMDUMP_MSG.txt"}, "firmware_sim");
+  d.write_file("/tmp/memory0.bin", std::string(9000, '\x22'));
+  RunResult r = d.run({MISC_DEVICE, USERDATA_DEVICE, "/tmp/memory0.bin", "/tmp/RAMDUMP_MSG.txt"},
+                      "firmware_sim");
   EXPECT_EQ(r.status, 0) << r.err;
   d.clear_log();
 }
@@ -235,8 +235,8 @@ std::vector<Case> cases() {
     {"next_block past the device's end: integrity test", "", {"-t", "-i", "5eed", kArmed}, 255, "",
      {E("error seeking to block fffffff0: Invalid argument")}, {}, nullptr,
      [](Context& c) { relink(c.device, c.armed, 3, 0xfffffff0u); }},
-    {"looping chain: firmware refuses", "", {MISC_DEVICE, USERDATA_DEVICE, "/tmp/ddr.bin"}, 1, "",
-     {}, {}, nullptr, loop,
+    {"looping chain: firmware refuses", "", {MISC_DEVICE, USERDATA_DEVICE, "/tmp/memory0.bin"}, 1,
+     "", {}, {}, nullptr, loop,
      [](Context& c) { EXPECT_NE(c.result.err.find("(chain block 6)"), std::string::npos); },
      "firmware_sim"},
     {"device-tree dev value without its NUL: the cut name is no device", "", {kArmed}, 255, "",
@@ -295,7 +295,7 @@ TEST(FaultInjection, EveryCase) {
   }
   FakeDeviceConfig config;
   config.data_bytes = 16ull << 30;  // the boot entry wants 10 GiB free to create the file
-  config.cmdline = "console=ttyMSM0 androidboot.hardware=rbtest androidboot.android_dt_dir=/dt\n";
+  config.cmdline = "console=ttyS0 androidboot.hardware=rbtest androidboot.android_dt_dir=/dt\n";
   FakeDevice d(config);
   ASSERT_EQ(d.setup_error(), "");
   d.write_file("/system/lib/libfault_inject.so", read_host_file(RB_FAULT_LIBRARY), 0755);

@@ -40,7 +40,7 @@ int main() {
   if (!enter_private_mount_namespace("valgrind_paths: private mount namespace")) return 1;
   FakeDeviceConfig config;
   config.data_bytes = 16ull << 30;  // the boot entry wants 6 GiB free beside the reserved file
-  config.cmdline = "console=ttyMSM0 androidboot.hardware=rbtest androidboot.android_dt_dir=/dt\n";
+  config.cmdline = "console=ttyS0 androidboot.hardware=rbtest androidboot.android_dt_dir=/dt\n";
   FakeDevice device(config);
   if (!device.setup_error().empty()) {
     fprintf(stderr, "fake device: %s\n", device.setup_error().c_str());
@@ -66,8 +66,8 @@ int main() {
        "--show-leak-kinds=definite,indirect,possible "
        "--errors-for-leak-kinds=definite,indirect,possible --suppressions=/tmp/valgrind.supp "
        "/system/bin/reserveblocks \"$@\"\n"},
-      {"/tmp/RAMDUMP_MSG.txt", "watchdog bite\n"},
-      {"/tmp/ddr.bin", std::string(20000, '\x22')},
+      {"/tmp/RAMDUMP_MSG.txt", "watchdog timeout\n"},
+      {"/tmp/memory0.bin", std::string(20000, '\x22')},
       {kReserved, std::string(64 * 4096, '\xFF')},
   };
   for (const auto& [path, content] : files) device.write_file(path, content, 0755);
@@ -88,11 +88,11 @@ int main() {
   write_host_file(device.misc_host_path(),
                   device.misc_bytes().replace(
                       3184, 24, make_ibh(map_file(device, kReserved, 1)[0], 4096, 64, 0xfeed, 1)));
-  ok = run(device, {MISC_DEVICE, USERDATA_DEVICE, "/tmp/ddr.bin", "/tmp/RAMDUMP_MSG.txt"},
+  ok = run(device, {MISC_DEVICE, USERDATA_DEVICE, "/tmp/memory0.bin", "/tmp/RAMDUMP_MSG.txt"},
            "firmware_sim") &&
        ok;
   ok = run(device, {"-a", "-p"}) && ok;
-  if (device.read_file("/data/vendor/ramdump/apq/00/RAMDUMP_MSG.txt") != "watchdog bite\n") {
+  if (device.read_file("/data/vendor/ramdump/apq/00/RAMDUMP_MSG.txt") != "watchdog timeout\n") {
     printf("the boot entry under memcheck did not extract the message\n");
     ok = false;
   }
