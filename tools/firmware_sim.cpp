@@ -1,17 +1,9 @@
-// firmware_sim: plays the boot firmware after a crash, for tests and demonstrations.
-//
-//   firmware_sim MISC DEVICE [FILE...]
-//
-// Reads the initial block header from the misc partition MISC (image or device), walks the
-// chain through the raw block device DEVICE verifying every magic and CRC, writes a dump
-// stream made of the FILEs (each a 40-byte record named after the file's base name, then its
-// content, no padding) into the payloads of the chain blocks in chain order without touching
-// their 16-byte headers, and sets the dump-present bit in the stored header. A broken chain
-// is refused before anything is written.
+// firmware_sim: plays the boot firmware after a crash, for tests and demonstrations. See kUsage.
 #include <errno.h>
 #include <fcntl.h>
 #include <stdio.h>
 #include <string.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -20,170 +12,255 @@
 
 #include "misc/misc_store.h"
 #include "ramdump/chain_format.h"
+#include "tools/chain_walk.h"
 
 namespace {
 
+const char kUsage[] =
+    "usage: firmware_sim [--verify-only] [--first-record-at N] MISC DEVICE [FILE...]\n"
+    "Plays the boot firmware after a crash. Reads the initial block header from the misc\n"
+    "partition MISC (image or device), walks the chain through the raw block device DEVICE\n"
+    "checking every magic and CRC, writes a dump stream made of the FILEs (each a 40-byte\n"
+    "record named after the file's base name, then its content, no padding) into the payloads\n"
+    "of the chain blocks in chain order without touching their 16-byte headers, and sets the\n"
+    "dump-present bit in the stored header. A broken chain is refused before anything is\n"
+    "written.\n"
+    "  --verify-only         walk and check the chain, change nothing (opens both read-only)\n"
+    "  --first-record-at N   start the stream with a record \"filler.bin\" of N - 40 zero bytes,\n"
+    "                        so that the first FILE's header starts at stream offset N\n"
+    "                        (0 or at least 40)\n"
+    "Exit status: 0, 1 on a refused chain or a failed read or write, 2 on a usage error.\n";
+
 constexpr uint32_t kDumpBlockSize = 4096;  // the dump stream is read back in 4096-byte units
+constexpr uint64_t kPayload = kDumpBlockSize - CHAIN_BLOCK_HEADER_SIZE;
+const char kFillerName[] = "filler.bin";
 
-bool read_exact(int fd, uint64_t offset, void* buf, size_t length) {
-  ssize_t n = pread(fd, buf, length, static_cast<off_t>(offset));
-  return n == static_cast<ssize_t>(length);
+int usage_error(const std::string& message) {
+  fprintf(stderr, "firmware_sim: %s\n%s", message.c_str(), kUsage);
+  return 2;
 }
 
-bool write_exact(int fd, uint64_t offset, const void* buf, size_t length) {
-  ssize_t n = pwrite(fd, buf, length, static_cast<off_t>(offset));
-  return n == static_cast<ssize_t>(length);
+int failure(const std::string& file, const std::string& problem) {
+  fprintf(stderr, "firmware_sim: %s: %s\n", file.c_str(), problem.c_str());
+  return 1;
 }
 
-bool read_file(const char* path, std::string* out) {
-  FILE* f = fopen(path, "rb");
-  if (f == nullptr) return false;
-  char buf[65536];
-  size_t n;
-  out->clear();
-  while ((n = fread(buf, 1, sizeof(buf), f)) > 0) out->append(buf, n);
-  bool ok = ferror(f) == 0;
-  fclose(f);
-  return ok;
-}
+// One record of the stream: its header, then size bytes read from fd (or zeros when fd < 0).
+struct record {
+  std::string path;
+  int fd;
+  uint64_t size;
+  uint8_t header[DUMP_FILE_RECORD_SIZE];
+};
 
-// Follows the chain from the stored header and returns its blocks in chain order, or prints
-// why the firmware would refuse it and returns false.
-bool walk_chain(int dev_fd, const initial_block_header& ibh, std::vector<uint32_t>* blocks) {
-  uint32_t block = ibh.first_block;
-  uint32_t running_crc = ibh.initial_crc;
-  for (uint32_t i = 0; i < ibh.block_count; ++i) {
-    uint8_t raw[CHAIN_BLOCK_HEADER_SIZE];
-    if (block == 0) {
-      fprintf(stderr, "firmware_sim: chain ends after %u of %u blocks\n", i, ibh.block_count);
-      return false;
-    }
-    if (!read_exact(dev_fd, static_cast<uint64_t>(block) * ibh.block_size, raw, sizeof(raw))) {
-      fprintf(stderr, "firmware_sim: cannot read block %u (chain block %u): %s\n", block, i,
-              strerror(errno));
-      return false;
-    }
-    chain_block_header h = decode_chain_block_header(raw);
-    if (h.magic != CHAIN_BLOCK_MAGIC) {
-      fprintf(stderr, "firmware_sim: bad magic %08x at block %u (chain block %u)\n", h.magic, block,
-              i);
-      return false;
-    }
-    running_crc = chain_crc(running_crc, block, h.next_block);
-    if (h.crc != running_crc) {
-      fprintf(stderr, "firmware_sim: bad CRC %08x at block %u (chain block %u), expected %08x\n",
-              h.crc, block, i, running_crc);
-      return false;
-    }
-    blocks->push_back(block);
-    block = h.next_block;
-  }
-  if (block != 0) {
-    fprintf(stderr, "firmware_sim: chain goes on past its %u blocks (to block %u)\n",
-            ibh.block_count, block);
+bool make_record(const std::string& path, int fd, const char* name, uint64_t size, record* out) {
+  if (strlen(name) >= DUMP_FILE_NAME_SIZE) {
+    fprintf(stderr, "firmware_sim: %s: record name %s is longer than %zu characters\n",
+            path.c_str(), name, DUMP_FILE_NAME_SIZE - 1);
     return false;
+  }
+  dump_file_record r = {};
+  r.magic = DUMP_FILE_MAGIC;
+  memcpy(r.name, name, strlen(name));
+  r.size = size;
+  *out = {path, fd, size, {}};
+  encode_dump_file_record(r, out->header);
+  return true;
+}
+
+// The records in stream order, read piece by piece: constant memory whatever the files' sizes.
+struct stream_reader {
+  std::vector<record>* records;
+  size_t current;
+  uint64_t offset;  // within the current record, header included
+};
+
+// Fills length bytes of the stream into out; false after printing why it cannot.
+bool read_stream(stream_reader* s, uint8_t* out, size_t length) {
+  while (length > 0) {
+    const record& r = (*s->records)[s->current];
+    size_t n;
+    if (s->offset < DUMP_FILE_RECORD_SIZE) {
+      n = std::min<size_t>(DUMP_FILE_RECORD_SIZE - s->offset, length);
+      memcpy(out, r.header + s->offset, n);
+    } else {
+      n = static_cast<size_t>(
+          std::min<uint64_t>(DUMP_FILE_RECORD_SIZE + r.size - s->offset, length));
+      if (r.fd < 0) {
+        memset(out, 0, n);
+      } else {
+        ssize_t got = read(r.fd, out, n);
+        if (got < 0 && errno == EINTR) continue;
+        if (got <= 0) {
+          failure(r.path, got == 0 ? "unexpected end of file" : strerror(errno));
+          return false;
+        }
+        n = static_cast<size_t>(got);
+      }
+    }
+    out += n;
+    length -= n;
+    s->offset += n;
+    if (s->offset == DUMP_FILE_RECORD_SIZE + r.size) {
+      ++s->current;
+      s->offset = 0;
+    }
   }
   return true;
 }
 
-// The dump stream of the files: a record header for each, followed by its content.
-bool build_stream(int argc, char** argv, std::string* stream) {
-  for (int i = 0; i < argc; ++i) {
-    std::string content;
-    if (!read_file(argv[i], &content)) {
-      fprintf(stderr, "firmware_sim: cannot read %s: %s\n", argv[i], strerror(errno));
-      return false;
-    }
-    const char* slash = strrchr(argv[i], '/');
-    const char* name = slash != nullptr ? slash + 1 : argv[i];
-    if (strlen(name) >= DUMP_FILE_NAME_SIZE) {
-      fprintf(stderr, "firmware_sim: record name %s is longer than %zu characters\n", name,
-              DUMP_FILE_NAME_SIZE - 1);
-      return false;
-    }
-    dump_file_record record = {};
-    record.magic = DUMP_FILE_MAGIC;
-    memcpy(record.name, name, strlen(name));
-    record.size = content.size();
-    uint8_t raw[DUMP_FILE_RECORD_SIZE];
-    encode_dump_file_record(record, raw);
-    stream->append(reinterpret_cast<const char*>(raw), sizeof(raw));
-    stream->append(content);
+struct writer {
+  int dev_fd;
+  const char* dev_path;
+  stream_reader stream;
+  uint64_t left;  // stream bytes still to write
+  bool failed;
+};
+
+// Stores the next payload's worth of the stream behind the block's header.
+bool write_payload(void* context, uint32_t, uint32_t block, const chain_block_header&) {
+  writer* w = static_cast<writer*>(context);
+  if (w->left == 0) return false;
+  uint8_t payload[kPayload];
+  const size_t length = static_cast<size_t>(std::min(kPayload, w->left));
+  if (!read_stream(&w->stream, payload, length)) {
+    w->failed = true;
+    return false;
   }
+  const uint64_t offset = static_cast<uint64_t>(block) * kDumpBlockSize + CHAIN_BLOCK_HEADER_SIZE;
+  ssize_t n = pwrite(w->dev_fd, payload, length, static_cast<off_t>(offset));
+  if (n != static_cast<ssize_t>(length)) {
+    failure(w->dev_path, "cannot write block " + std::to_string(block) + ": " +
+                             (n < 0 ? strerror(errno) : "short write"));
+    w->failed = true;
+    return false;
+  }
+  w->left -= length;
   return true;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  if (argc < 3) {
-    fprintf(stderr, "usage: %s MISC DEVICE [FILE...]\n", argv[0]);
-    return 2;
+  bool verify_only = false;
+  bool filler = false;
+  uint64_t first_record_at = 0;
+  int i = 1;
+  for (; i < argc && strncmp(argv[i], "--", 2) == 0; ++i) {
+    const std::string arg = argv[i];
+    if (arg == "--help") {
+      fputs(kUsage, stdout);
+      return 0;
+    } else if (arg == "--verify-only") {
+      verify_only = true;
+    } else if (arg == "--first-record-at") {
+      char* end = nullptr;
+      if (i + 1 >= argc || argv[i + 1][0] < '0' || argv[i + 1][0] > '9') {
+        return usage_error("--first-record-at needs a number");
+      }
+      errno = 0;
+      first_record_at = strtoull(argv[++i], &end, 10);
+      if (errno != 0 || *end != '\0' || (first_record_at != 0 && first_record_at < 40)) {
+        return usage_error("--first-record-at takes 0 or a number of at least 40");
+      }
+      filler = first_record_at != 0;
+    } else if (arg == "--") {
+      ++i;
+      break;
+    } else {
+      return usage_error("unknown option " + arg);
+    }
   }
-  const char* misc_path = argv[1];
-  const char* dev_path = argv[2];
-  const uint64_t ibh_offset = gPartitionInfo_MISC[1].offset;
+  if (argc - i < 2) return usage_error("MISC and DEVICE are needed");
+  const char* misc_path = argv[i];
+  const char* dev_path = argv[i + 1];
+  const int first_file = i + 2;
+  const int open_mode = (verify_only ? O_RDONLY : O_RDWR) | O_CLOEXEC;
 
-  int misc_fd = open(misc_path, O_RDWR | O_CLOEXEC);
-  if (misc_fd < 0) {
-    fprintf(stderr, "firmware_sim: cannot open %s: %s\n", misc_path, strerror(errno));
-    return 1;
-  }
+  int misc_fd = open(misc_path, open_mode);
+  if (misc_fd < 0) return failure(misc_path, std::string("cannot open: ") + strerror(errno));
   uint8_t raw_ibh[INITIAL_BLOCK_HEADER_SIZE];
-  if (!read_exact(misc_fd, ibh_offset, raw_ibh, sizeof(raw_ibh))) {
-    fprintf(stderr, "firmware_sim: cannot read the initial block header from %s\n", misc_path);
-    return 1;
+  if (read_misc_item(misc_fd, 2, raw_ibh) != 0) {
+    return failure(misc_path, "cannot read the initial block header: " + io_problem(errno));
   }
   initial_block_header ibh = decode_initial_block_header(raw_ibh);
   if (ibh.magic != INITIAL_BLOCK_HEADER_MAGIC) {
-    fprintf(stderr, "firmware_sim: no armed chain: initial block header magic is %08x\n",
-            ibh.magic);
-    return 1;
+    char problem[80];
+    snprintf(problem, sizeof(problem), "no armed chain: initial block header magic is %08x",
+             ibh.magic);
+    return failure(misc_path, problem);
   }
   if (ibh.block_size != kDumpBlockSize) {
-    fprintf(stderr, "firmware_sim: block size %u, but dumps are stored in %u-byte blocks\n",
-            ibh.block_size, kDumpBlockSize);
-    return 1;
+    return failure(misc_path, "block size " + std::to_string(ibh.block_size) + ", but dumps are " +
+                                  "stored in " + std::to_string(kDumpBlockSize) + "-byte blocks");
   }
-  int dev_fd = open(dev_path, O_RDWR | O_CLOEXEC);
-  if (dev_fd < 0) {
-    fprintf(stderr, "firmware_sim: cannot open %s: %s\n", dev_path, strerror(errno));
-    return 1;
+  int dev_fd = open(dev_path, open_mode);
+  if (dev_fd < 0) return failure(dev_path, std::string("cannot open: ") + strerror(errno));
+  chain_walk_result walk;
+  int status = walk_chain(dev_fd, ibh, nullptr, nullptr, &walk);
+  if (status != WALK_OK) return failure(dev_path, walk_problem(status, walk, ibh));
+  if (verify_only) {
+    printf("chain: %u blocks from block %u verified (initial CRC %08x)\n", walk.blocks,
+           ibh.first_block, ibh.initial_crc);
+    return 0;
   }
-  std::vector<uint32_t> blocks;
-  if (!walk_chain(dev_fd, ibh, &blocks)) return 1;
 
-  std::string stream;
-  if (!build_stream(argc - 3, argv + 3, &stream)) return 1;
-  const uint64_t payload = kDumpBlockSize - CHAIN_BLOCK_HEADER_SIZE;
-  if (stream.size() > blocks.size() * payload) {
-    fprintf(stderr, "firmware_sim: a dump of %zu bytes does not fit the chain's %llu bytes\n",
-            stream.size(), static_cast<unsigned long long>(blocks.size() * payload));
-    return 1;
+  // Every file is opened and measured before anything is written.
+  std::vector<record> records;
+  uint64_t stream_size = 0;
+  if (filler) {
+    records.emplace_back();
+    make_record("--first-record-at", -1, kFillerName, first_record_at - DUMP_FILE_RECORD_SIZE,
+                &records.back());
   }
-  for (size_t k = 0; k * payload < stream.size(); ++k) {
-    size_t length = std::min<size_t>(payload, stream.size() - k * payload);
-    uint64_t offset = static_cast<uint64_t>(blocks[k]) * kDumpBlockSize + CHAIN_BLOCK_HEADER_SIZE;
-    if (!write_exact(dev_fd, offset, stream.data() + k * payload, length)) {
-      fprintf(stderr, "firmware_sim: cannot write block %u: %s\n", blocks[k], strerror(errno));
+  for (int f = first_file; f < argc; ++f) {
+    int fd = open(argv[f], O_RDONLY | O_CLOEXEC);
+    struct stat st;
+    if (fd < 0 || fstat(fd, &st) != 0) return failure(argv[f], strerror(errno));
+    const char* slash = strrchr(argv[f], '/');
+    records.emplace_back();
+    if (!make_record(argv[f], fd, slash != nullptr ? slash + 1 : argv[f],
+                     static_cast<uint64_t>(st.st_size), &records.back())) {
       return 1;
     }
   }
-  fsync(dev_fd);
+  for (const record& r : records) stream_size += DUMP_FILE_RECORD_SIZE + r.size;
+  const uint64_t capacity = static_cast<uint64_t>(walk.blocks) * kPayload;
+  if (stream_size > capacity) {
+    fprintf(stderr, "firmware_sim: %s: a dump of %llu bytes does not fit the chain's %llu bytes\n",
+            dev_path, static_cast<unsigned long long>(stream_size),
+            static_cast<unsigned long long>(capacity));
+    return 1;
+  }
+
+  // The chain was just verified, so the second walk visits the same blocks.
+  writer w = {dev_fd, dev_path, {&records, 0, 0}, stream_size, false};
+  status = walk_chain(dev_fd, ibh, write_payload, &w, &walk);
+  if (w.failed) return 1;
+  if (status != WALK_OK) return failure(dev_path, walk_problem(status, walk, ibh));
+  if (fsync(dev_fd) != 0) return failure(dev_path, std::string("fsync: ") + strerror(errno));
   close(dev_fd);
+  for (const record& r : records) {
+    if (r.fd >= 0) close(r.fd);
+  }
 
   const uint32_t old_state = ibh.state;
   ibh.state |= STATE_DUMP_PRESENT;
   encode_initial_block_header(ibh, raw_ibh);
-  if (!write_exact(misc_fd, ibh_offset, raw_ibh, sizeof(raw_ibh)) || fsync(misc_fd) != 0) {
-    fprintf(stderr, "firmware_sim: cannot store the initial block header: %s\n", strerror(errno));
-    return 1;
+  const misc_item_info& item = gPartitionInfo_MISC[1];
+  ssize_t n = pwrite(misc_fd, raw_ibh, item.length, item.offset);
+  if (n != static_cast<ssize_t>(item.length) || fsync(misc_fd) != 0) {
+    return failure(
+        misc_path,
+        std::string("cannot store the initial block header: ") +
+            (n >= 0 && n < static_cast<ssize_t>(item.length) ? "short write" : strerror(errno)));
   }
   close(misc_fd);
-  printf("chain: %zu blocks from block %u verified (initial CRC %08x)\n", blocks.size(),
+  printf("chain: %u blocks from block %u verified (initial CRC %08x)\n", ibh.block_count,
          ibh.first_block, ibh.initial_crc);
-  printf("dump: %d records, %zu bytes in %zu blocks\n", argc - 3, stream.size(),
-         (stream.size() + payload - 1) / payload);
+  printf("dump: %zu records, %llu bytes in %llu blocks\n", records.size(),
+         static_cast<unsigned long long>(stream_size),
+         static_cast<unsigned long long>((stream_size + kPayload - 1) / kPayload));
   printf("state: 0x%08x -> 0x%08x\n", old_state, ibh.state);
   return 0;
 }

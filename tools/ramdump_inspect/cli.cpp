@@ -29,7 +29,9 @@ bool parse_u32(const char* text, bool hex, uint32_t* out) {
     return false;
   char* end = nullptr;
   errno = 0;
-  unsigned long long v = strtoull(text, &end, hex ? 16 : 0);
+  // Base 0 would read a leading 0 as octal: "010" is ten here.
+  const bool prefixed = text[0] == '0' && (text[1] == 'x' || text[1] == 'X');
+  unsigned long long v = strtoull(text, &end, hex || prefixed ? 16 : 10);
   if (errno != 0 || *end != '\0' || v > 0xFFFFFFFFull) return false;
   *out = static_cast<uint32_t>(v);
   return true;
