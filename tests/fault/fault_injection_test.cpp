@@ -263,7 +263,7 @@ std::vector<Case> cases() {
      misc_gone + ", item=2\n", {E("Failed to read initial block header from MISC partition")},
      boot, nullptr},
     {"looping chain at boot: read out and re-armed", "", {"-a"}, 0, "",
-     {I("Found file 'RAMDUMP_MSG.txt', size 23"), E("* bad magic, got 00000000, expecting 654c3146")},
+     {I("Found file 'RAMDUMP_MSG.txt', size 26"), E("* bad magic, got 00000000, expecting 654c3146")},
      collected, kReserved, loop,
      [](Context& c) {
        EXPECT_EQ(c.device.read_file(kMessage), kMsgText);
