@@ -3,7 +3,7 @@
 # packages, Debian's aarch64 cross compiler, qemu-user and the arm64 packages of the
 # dependencies next to the amd64 ones), builds the tool and its tests for aarch64 into
 # build-aarch64/, and then:
-#   1. checks that android/Android.bp lists every source file of the tool;
+#   1. checks that android/Android.bp lists every source file of the tool and of ramdump_inspect;
 #   2. runs CTest there: the unit tests and the device tests, every aarch64 program under
 #      qemu-aarch64-static (the full-size crash cycle is left to the x86-64 run of
 #      scripts/test.sh, the fault cases see below);
@@ -249,14 +249,23 @@ cmake --build build-aarch64 -j"$(nproc)"
 
 status=0
 # The device build (android/Android.bp) compiles the same sources; a file missing there would
-# only show as a link failure in a device tree.
-listed=$(grep -o '"[a-z_]*/[a-z_]*\.cpp"' android/Android.bp | tr -d '"' | sort)
-present=$(printf '%s\n' ramdump/*.cpp misc/*.cpp fs_mgr/*.cpp platform/*.cpp | sort)
-if [ "$listed" != "$present" ]; then
-  echo "android/Android.bp does not list the tool's sources:" >&2
-  diff <(echo "$listed") <(echo "$present") >&2 || true
-  status=1
-fi
+# only show as a link failure in a device tree. Module $1's srcs against the files $2...
+check_bp_sources() {
+  local module=$1 listed present
+  shift
+  listed=$(awk -v name="\"$module\"," '$1 == "name:" { in_module = $2 == name }
+    in_module && $1 ~ /^"[a-z_\/]*\.cpp",$/ { gsub(/[",]/, "", $1); print $1 }' \
+    android/Android.bp | sort)
+  present=$(printf '%s\n' "$@" | sort)
+  if [ "$listed" != "$present" ]; then
+    echo "android/Android.bp does not list the sources of $module:" >&2
+    diff <(echo "$listed") <(echo "$present") >&2 || true
+    status=1
+  fi
+}
+check_bp_sources reserveblocks ramdump/*.cpp misc/*.cpp fs_mgr/*.cpp platform/*.cpp
+check_bp_sources ramdump_inspect tools/ramdump_inspect/*.cpp tools/chain_walk.cpp \
+  ramdump/chain_format.cpp misc/misc_store.cpp
 
 # Left out: the full-size crash cycle (x86-64 only, see above), and the fault cases, which start
 # the tool with execv of their own rather than through the harness, so not under the emulator.

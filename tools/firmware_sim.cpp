@@ -216,7 +216,9 @@ int main(int argc, char** argv) {
   for (int f = first_file; f < argc; ++f) {
     int fd = open(argv[f], O_RDONLY | O_CLOEXEC);
     struct stat st;
-    if (fd < 0 || fstat(fd, &st) != 0) return failure(argv[f], strerror(errno));
+    if (fd < 0 || fstat(fd, &st) != 0) {
+      return failure(argv[f], std::string("cannot open: ") + strerror(errno));
+    }
     const char* slash = strrchr(argv[f], '/');
     records.emplace_back();
     if (!make_record(argv[f], fd, slash != nullptr ? slash + 1 : argv[f],
