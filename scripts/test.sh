@@ -4,9 +4,9 @@
 # filter for a bounded time (scripts/fuzz.sh), runs the main paths under valgrind
 # (scripts/valgrind.sh), tests the aarch64 build under emulation (scripts/test-aarch64.sh),
 # checks the Android policy and build file (scripts/check-android.sh), and runs CTest on both
-# builds. The full-size crash cycle (4 GiB
-# written and read back) runs in the plain build only. Run as root: the device tests use loop
-# devices, mount namespaces and chroot (without root they are skipped).
+# builds. The full-size crash cycle (4 GiB written and read back) runs in the plain build
+# only. Run as root: the device tests use loop devices, mount namespaces and chroot (without
+# root they are skipped).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
