@@ -40,6 +40,8 @@ const char kUsage[] =
     "Exit status: 0 when every wanted record was written complete, 1 otherwise, 2 on a usage\n"
     "error.\n";
 
+static_assert(READ_UNITS <= IOV_MAX, "one writev takes a whole read");
+
 struct extract_state {
   const char* dir;
   int dir_fd;
@@ -49,7 +51,7 @@ struct extract_state {
   name_set names;  // record and file names met, with the flags below
   int fd;          // the current record's file, or -1 while records are skipped
   std::string file, note;
-  iovec pending[IOV_MAX];
+  iovec pending[READ_UNITS];  // a record has at most one piece in each unit
   size_t pending_count;
   bool failed;
 };
@@ -140,7 +142,6 @@ int flush(void* ctx) {
 int on_content(void* ctx, const uint8_t* data, size_t length) {
   extract_state* st = static_cast<extract_state*>(ctx);
   if (st->fd < 0) return 0;
-  if (st->pending_count == IOV_MAX && flush(ctx) < 0) return -1;
   st->pending[st->pending_count++] = {const_cast<uint8_t*>(data), length};
   return 0;
 }
