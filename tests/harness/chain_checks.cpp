@@ -91,3 +91,14 @@ std::string dump_record(const std::string& name, uint64_t size, const std::strin
   return "F1Le" + field + le32(static_cast<uint32_t>(size)) +
          le32(static_cast<uint32_t>(size >> 32)) + le32(0x5555) + le32(0) + content;
 }
+
+std::string readout_units(const std::string& stream) {
+  const size_t payload = 4080;
+  std::string out;
+  for (size_t at = 0; at < stream.size(); at += payload) {
+    std::string piece = stream.substr(at, payload);
+    piece.resize(payload, '\0');
+    out += "BCho" + std::string(12, '\0') + piece;
+  }
+  return out;
+}

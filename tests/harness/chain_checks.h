@@ -28,6 +28,9 @@ std::string stored_ibh(const FakeDevice& device);
 // field as it is (20 characters leave no terminator), the size, a reserved field that readers
 // ignore (set nonzero), then content, which may be shorter than size.
 std::string dump_record(const std::string& name, uint64_t size, const std::string& content);
+// The stream as a read-out holds it: 4080-byte payloads, each behind a chain block header with
+// magic "BCho" (the rest zero), the last one padded with the zeros the arming left.
+std::string readout_units(const std::string& stream);
 
 std::string make_ibh(uint32_t first_block, uint32_t block_size, uint32_t count, uint32_t crc,
                      uint32_t state);

@@ -39,20 +39,6 @@ std::string record(const std::string& name, const std::string& content) {
   return dump_record(name, content.size(), content);
 }
 
-// The stream as a read-out holds it: payloads behind chain block headers, the last one padded
-// with the zeros the arming left.
-std::string units(const std::string& stream) {
-  uint8_t header[CHAIN_BLOCK_HEADER_SIZE];
-  encode_chain_block_header({CHAIN_BLOCK_MAGIC, 0, 0, 1, 0}, header);
-  std::string out;
-  for (size_t at = 0; at < stream.size(); at += kPayload) {
-    std::string payload = stream.substr(at, kPayload);
-    payload.resize(kPayload, '\0');
-    out += std::string(reinterpret_cast<char*>(header), sizeof(header)) + payload;
-  }
-  return out;
-}
-
 class DumpExtract : public testing::Test {
  protected:
   void SetUp() override {
@@ -98,9 +84,9 @@ TEST_F(DumpExtract, RecordHeadersAcrossUnits) {
     SCOPED_TRACE(testing::Message() << "split " << c.first << "/" << c.second);
     const std::string stream = record("PMIC", pattern(kPayload - c.first - 40, 1)) +
                                record("KLOG", pattern(kPayload + c.first - c.second - 40, 2)) +
-                               record("RAMDUMP_MSG.txt", msg) + record("FW", "fw");
+                               record("RAMDUMP_MSG.txt", msg) + record("TZ", "tz");
     std::string message;
-    EXPECT_EQ(extract(units(stream), &message), "");
+    EXPECT_EQ(extract(readout_units(stream), &message), "");
     EXPECT_EQ(message, c.whole ? msg : "(none)");
     EXPECT_NE(logged.find("E * bad magic"), npos) << logged;
     EXPECT_EQ(logged.find(kZeroMagic) != npos, c.whole) << logged;
@@ -110,12 +96,13 @@ TEST_F(DumpExtract, RecordHeadersAcrossUnits) {
 // Read-outs that end the extraction early or oddly: what goes to standard error, the message
 // file and the whole log.
 TEST_F(DumpExtract, Endings) {
-  const std::string msg = pattern(6000, 7), two_units = units(record("RAMDUMP_MSG.txt", msg));
+  const std::string msg = pattern(6000, 7),
+                    two_units = readout_units(record("RAMDUMP_MSG.txt", msg));
   std::string damaged = two_units;
   put_le32(reinterpret_cast<uint8_t*>(&damaged[kUnit]), 0x12345678);
   const std::string empty_wanted = record("RAMDUMP_MSG.txt", "");
   const std::string filler = record("KLOG", pattern(kPayload - 80, 5));  // ends a payload
-  const std::string tail = record("RAMDUMP_MSG.txt", "msg") + record("FW", pattern(kPayload, 9));
+  const std::string tail = record("RAMDUMP_MSG.txt", "msg") + record("TZ", pattern(kPayload, 9));
   const std::string huge = dump_record("RAMDUMP_MSG.txt", 1ull << 40, "k") + tail;
   const std::string huger = dump_record("RAMDUMP_MSG.txt", ~0ull, "k") + tail;
   // The payloads after the first record header, which a record of a huge size takes.
@@ -132,11 +119,11 @@ TEST_F(DumpExtract, Endings) {
   } cases[] = {
       // A zero-length item is never reported as written, so a wanted record of size 0 fails as
       // soon as any data follows it, in the same payload or the next unit.
-      {"empty wanted record, zeros after it", units(record("KLOG", "k") + empty_wanted),
+      {"empty wanted record, zeros after it", readout_units(record("KLOG", "k") + empty_wanted),
        "Could not write 0 bytes", "", found + "0\n"},
-      {"empty wanted record, data in the next unit", units(filler + empty_wanted + tail),
+      {"empty wanted record, data in the next unit", readout_units(filler + empty_wanted + tail),
        "Could not write 0 bytes", "", found + "0\n"},
-      {"empty wanted record, nothing after it", units(filler + empty_wanted), "", "",
+      {"empty wanted record, nothing after it", readout_units(filler + empty_wanted), "", "",
        found + "0\n"},
       {"bad chain block magic in the second unit", damaged,
        "* bad block header magic, got 12345678, expecting 6f684342\n", msg.substr(0, kPayload - 40),
@@ -145,10 +132,11 @@ TEST_F(DumpExtract, Endings) {
        msg.substr(0, kPayload - 40), found + "6000\n"},
       // Sizes beyond the data: a record that is not wanted swallows everything after it, a wanted
       // one takes it all, also with a size past the signed range.
-      {"huge record before the wanted one", units(dump_record("KLOG", 1ull << 40, "k") + tail), "",
-       "(none)", ""},
-      {"huge wanted record", units(huge), "", rest(units(huge)), found + "1099511627776\n"},
-      {"wanted record past the signed range", units(huger), "", rest(units(huger)),
+      {"huge record before the wanted one",
+       readout_units(dump_record("KLOG", 1ull << 40, "k") + tail), "", "(none)", ""},
+      {"huge wanted record", readout_units(huge), "", rest(readout_units(huge)),
+       found + "1099511627776\n"},
+      {"wanted record past the signed range", readout_units(huger), "", rest(readout_units(huger)),
        found + "18446744073709551615\n"},
   };
   for (const auto& c : cases) {
@@ -166,7 +154,7 @@ TEST_F(DumpExtract, Endings) {
 // The output path is built for every record; one longer than 4096 characters ends the process
 // instead of being cut short.
 TEST_F(DumpExtract, OutputPathLimit) {
-  const std::string stream = record("FW_DIAG", ""), fits(4096 - strlen("/FW_DIAG"), 'd');
+  const std::string stream = record("TZ_DIAG", ""), fits(4096 - strlen("/TZ_DIAG"), 'd');
   FILE* out = nullptr;
   auto filter = [&](const std::string& out_dir) {
     reset_dump_filter_state_for_test();
