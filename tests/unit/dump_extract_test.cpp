@@ -84,7 +84,7 @@ TEST_F(DumpExtract, RecordHeadersAcrossUnits) {
     SCOPED_TRACE(testing::Message() << "split " << c.first << "/" << c.second);
     const std::string stream = record("PMIC", pattern(kPayload - c.first - 40, 1)) +
                                record("KLOG", pattern(kPayload + c.first - c.second - 40, 2)) +
-                               record("RAMDUMP_MSG.txt", msg) + record("TZ", "tz");
+                               record("RAMDUMP_MSG.txt", msg) + record("FW", "fw");
     std::string message;
     EXPECT_EQ(extract(readout_units(stream), &message), "");
     EXPECT_EQ(message, c.whole ? msg : "(none)");
@@ -102,7 +102,7 @@ TEST_F(DumpExtract, Endings) {
   put_le32(reinterpret_cast<uint8_t*>(&damaged[kUnit]), 0x12345678);
   const std::string empty_wanted = record("RAMDUMP_MSG.txt", "");
   const std::string filler = record("KLOG", pattern(kPayload - 80, 5));  // ends a payload
-  const std::string tail = record("RAMDUMP_MSG.txt", "msg") + record("TZ", pattern(kPayload, 9));
+  const std::string tail = record("RAMDUMP_MSG.txt", "msg") + record("FW", pattern(kPayload, 9));
   const std::string huge = dump_record("RAMDUMP_MSG.txt", 1ull << 40, "k") + tail;
   const std::string huger = dump_record("RAMDUMP_MSG.txt", ~0ull, "k") + tail;
   // The payloads after the first record header, which a record of a huge size takes.
@@ -154,7 +154,7 @@ TEST_F(DumpExtract, Endings) {
 // The output path is built for every record; one longer than 4096 characters ends the process
 // instead of being cut short.
 TEST_F(DumpExtract, OutputPathLimit) {
-  const std::string stream = record("TZ_DIAG", ""), fits(4096 - strlen("/TZ_DIAG"), 'd');
+  const std::string stream = record("FW_DIAG", ""), fits(4096 - strlen("/FW_DIAG"), 'd');
   FILE* out = nullptr;
   auto filter = [&](const std::string& out_dir) {
     reset_dump_filter_state_for_test();
