@@ -32,6 +32,13 @@ int read_misc_item(int fd, int item, uint8_t* out) {
   return pread_full(fd, out, info.length, static_cast<off_t>(info.offset));
 }
 
+int read_stored_header(int misc_fd, initial_block_header* ibh) {
+  uint8_t raw[INITIAL_BLOCK_HEADER_SIZE];
+  if (read_misc_item(misc_fd, 2, raw) != 0) return -1;
+  *ibh = decode_initial_block_header(raw);
+  return 0;
+}
+
 const char* no_chain_reason(const initial_block_header& ibh) {
   if (ibh.magic == INITIAL_BLOCK_HEADER_MAGIC) return nullptr;
   if ((ibh.magic | ibh.first_block | ibh.block_size | ibh.block_count | ibh.initial_crc |

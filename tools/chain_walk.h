@@ -22,6 +22,10 @@ std::string io_problem(int error);
 // Returns 0 or -1 like pread_full.
 int read_misc_item(int fd, int item, uint8_t* out);
 
+// Reads and decodes the initial block header item of a misc partition image or device.
+// Returns 0 or -1 like pread_full.
+int read_stored_header(int misc_fd, initial_block_header* ibh);
+
 // Why a stored initial block header names no chain, or nullptr when it names one.
 const char* no_chain_reason(const initial_block_header& ibh);
 

@@ -179,11 +179,10 @@ int main(int argc, char** argv) {
 
   int misc_fd = open(misc_path, open_mode);
   if (misc_fd < 0) return failure(misc_path, std::string("cannot open: ") + strerror(errno));
-  uint8_t raw_ibh[INITIAL_BLOCK_HEADER_SIZE];
-  if (read_misc_item(misc_fd, 2, raw_ibh) != 0) {
+  initial_block_header ibh;
+  if (read_stored_header(misc_fd, &ibh) != 0) {
     return failure(misc_path, "cannot read the initial block header: " + io_problem(errno));
   }
-  initial_block_header ibh = decode_initial_block_header(raw_ibh);
   if (ibh.magic != INITIAL_BLOCK_HEADER_MAGIC) {
     char problem[80];
     snprintf(problem, sizeof(problem), "no armed chain: initial block header magic is %08x",
@@ -248,6 +247,7 @@ int main(int argc, char** argv) {
 
   const uint32_t old_state = ibh.state;
   ibh.state |= STATE_DUMP_PRESENT;
+  uint8_t raw_ibh[INITIAL_BLOCK_HEADER_SIZE];
   encode_initial_block_header(ibh, raw_ibh);
   const misc_item_info& item = gPartitionInfo_MISC[1];
   ssize_t n = pwrite(misc_fd, raw_ibh, item.length, item.offset);

@@ -12,7 +12,6 @@
 #include <string>
 #include <vector>
 
-#include "misc/misc_store.h"
 #include "ramdump/chain_format.h"
 #include "tools/chain_walk.h"
 #include "tools/ramdump_inspect/cli.h"
@@ -175,15 +174,13 @@ void print_report(const chain_report& r, bool json, const char* kind, const char
 }
 
 // The stored initial block header of MISC, which must name a chain.
-int read_stored_header(const char* misc, initial_block_header* ibh) {
+int stored_chain(const char* misc, initial_block_header* ibh) {
   int fd = open(misc, O_RDONLY | O_CLOEXEC);
   if (fd < 0) return fail(misc, strerror(errno));
-  uint8_t raw[INITIAL_BLOCK_HEADER_SIZE];
-  int rc = read_misc_item(fd, 2, raw);
+  int rc = read_stored_header(fd, ibh);
   int error = errno;
   close(fd);
   if (rc != 0) return fail(misc, "cannot read the initial block header: " + io_problem(error));
-  *ibh = decode_initial_block_header(raw);
   if (const char* why = no_chain_reason(*ibh)) {
     return fail(misc, std::string("the stored initial block header is ") + why);
   }
@@ -321,7 +318,7 @@ bool visit_device_block(void* context, uint32_t index, uint32_t block,
 
 int verify_device(const char* device, const char* misc, bool json) {
   initial_block_header ibh;
-  if (int rc = read_stored_header(misc, &ibh)) return rc;
+  if (int rc = stored_chain(misc, &ibh)) return rc;
   int fd = open(device, O_RDONLY | O_CLOEXEC);
   if (fd < 0) return fail(device, strerror(errno));
   device_check c = {};
@@ -411,7 +408,7 @@ int cmd_verify(int argc, char** argv) {
                        0);
   }
   initial_block_header ibh;
-  if (int rc = read_stored_header(misc, &ibh)) return rc;
+  if (int rc = stored_chain(misc, &ibh)) return rc;
   return verify_file(output, json, ibh.block_size, true, ibh.first_block, ibh.initial_crc, true,
                      ibh.block_count);
 }
