@@ -26,6 +26,17 @@ int sink_record_end(const dump_stream_sink& sink, const dump_stream_record& r, b
   return sink.record_end == nullptr ? 0 : sink.record_end(sink.ctx, r, complete, received);
 }
 
+// Ends the stream when the first `have` bytes of the header in s->header are not those of the
+// record magic.
+bool end_at_bad_magic(dump_stream* s, size_t have) {
+  if (memcmp(s->header, kRecordMagic, have) == 0) return false;
+  s->state = STREAM_BAD_MAGIC;
+  s->end_offset = s->offset - s->header_have;
+  memcpy(s->bad_magic, s->header, have);
+  s->bad_magic_length = have;
+  return true;
+}
+
 // Takes a record header that is complete in s->header.
 int take_header(dump_stream* s, const dump_stream_sink& sink) {
   const dump_file_record h = decode_dump_file_record(s->header);
@@ -77,17 +88,9 @@ int dump_stream_feed(dump_stream* s, const uint8_t* data, size_t length,
                          ? DUMP_FILE_RECORD_SIZE - s->header_have
                          : length;
     memcpy(s->header + s->header_have, data, n);
-    // The magic is judged on as many of its bytes as have arrived, so that a stream ending in
-    // one to three bytes of zeros still ends at a bad magic rather than inside a header.
-    if (s->header_have < sizeof(kRecordMagic)) {
-      const size_t have = s->header_have + n < 4 ? s->header_have + n : 4;
-      if (memcmp(s->header, kRecordMagic, have) != 0) {
-        s->state = STREAM_BAD_MAGIC;
-        s->end_offset = s->offset - s->header_have;
-        memcpy(s->bad_magic, s->header, have);
-        s->bad_magic_length = have;
-        return 0;
-      }
+    if (s->header_have < sizeof(kRecordMagic) && s->header_have + n >= sizeof(kRecordMagic) &&
+        end_at_bad_magic(s, sizeof(kRecordMagic))) {
+      return 0;
     }
     s->header_have += n;
     s->offset += n;
@@ -104,6 +107,12 @@ int dump_stream_feed(dump_stream* s, const uint8_t* data, size_t length,
 int dump_stream_finish(dump_stream* s, const dump_stream_sink& sink) {
   switch (s->state) {
     case STREAM_HEADER:
+      // One to three bytes at the end are judged on as much of the magic as they hold, so that
+      // a stream ending in a few zeros ends at a bad magic rather than inside a header.
+      if (s->header_have > 0 && s->header_have < sizeof(kRecordMagic) &&
+          end_at_bad_magic(s, s->header_have)) {
+        return 0;
+      }
       s->state = s->header_have == 0 ? STREAM_END_OF_DATA : STREAM_CUT_HEADER;
       s->end_offset = s->offset - s->header_have;
       return 0;

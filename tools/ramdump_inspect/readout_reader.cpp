@@ -41,7 +41,12 @@ int readout_open(readout_reader* r, const char* path, const char* what) {
     r->partial_offset = r->size - r->partial;
   }
   posix_fadvise(r->fd, 0, 0, POSIX_FADV_SEQUENTIAL);
-  if (posix_memalign(reinterpret_cast<void**>(&r->buffer), UNIT_SIZE, kReadSize) != 0) {
+  // A small read-out gets a buffer of its own size.
+  r->capacity = kReadSize;
+  if (S_ISREG(st.st_mode) && r->size < kReadSize) {
+    r->capacity = (r->size / UNIT_SIZE + 1) * UNIT_SIZE;
+  }
+  if (posix_memalign(reinterpret_cast<void**>(&r->buffer), UNIT_SIZE, r->capacity) != 0) {
     close(r->fd);
     r->fd = -1;
     fail(path, "out of memory");
@@ -54,8 +59,8 @@ int readout_open(readout_reader* r, const char* path, const char* what) {
 size_t readout_next(readout_reader* r, const uint8_t** units) {
   if (r->done) return 0;
   size_t have = 0;
-  while (have < kReadSize) {
-    ssize_t n = read(r->fd, r->buffer + have, kReadSize - have);
+  while (have < r->capacity) {
+    ssize_t n = read(r->fd, r->buffer + have, r->capacity - have);
     if (n < 0 && errno == EINTR) continue;
     if (n < 0) {
       r->read_errno = errno;

@@ -20,6 +20,7 @@ struct readout_reader {
   std::string path;
   int fd = -1;
   uint8_t* buffer = nullptr;
+  size_t capacity = 0;  // of the buffer, a multiple of UNIT_SIZE
   uint64_t size = 0;    // of a regular file, for progress; 0 otherwise
   uint64_t offset = 0;  // file offset of the next read
   uint64_t units = 0;   // whole good units handed out
