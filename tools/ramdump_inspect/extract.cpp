@@ -54,6 +54,7 @@ struct extract_state {
   iovec pending[READ_UNITS];  // a record has at most one piece in each unit
   size_t pending_count;
   bool failed;
+  progress* prog;  // cleared before a line is printed
 };
 
 bool is_wanted(extract_state* st, const std::string& name, const std::string& file) {
@@ -166,6 +167,7 @@ int on_record_end(void* ctx, const dump_stream_record& r, bool complete, uint64_
     st->failed = true;
   }
   if (!st->note.empty()) line += " (" + st->note + ")";
+  progress_end(st->prog);
   printf("%s\n", line.c_str());
   if (!complete) {
     fail(path, "the data ends inside its record, after " + std::to_string(received) + " of " +
@@ -214,6 +216,7 @@ int cmd_extract(int argc, char** argv) {
     close(st.dir_fd);
     return kExitBad;
   }
+  st.prog = &reader.prog;
   dump_stream stream;
   dump_stream_init(&stream);
   const int rc =

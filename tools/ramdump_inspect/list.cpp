@@ -41,6 +41,7 @@ struct list_state {
   bool json;
   uint64_t printed;
   name_set names;
+  progress* prog;  // cleared before a record is printed
 };
 
 int print_record(void* ctx, const dump_stream_record& r, bool complete, uint64_t received) {
@@ -60,6 +61,7 @@ int print_record(void* ctx, const dump_stream_record& r, bool complete, uint64_t
   if (problems & NAME_UNSAFE) note("unsafe file name");
   unsigned* seen = name_set_entry(&st.names, name);
   if (seen != nullptr && (*seen)++ > 0) note("repeated name");
+  progress_end(st.prog);
   if (st.json) {
     printf("%s\n  {\"name\": %s, \"size\": %" PRIu64 ", \"offset\": %" PRIu64
            ", \"complete\": %s, \"notes\": [%s]}",
@@ -90,7 +92,7 @@ int cmd_list(int argc, char** argv) {
     fputs(kUsage, stdout);
     return kExitOk;
   }
-  list_state st = {false, 0, {}};
+  list_state st = {false, 0, {}, nullptr};
   int i = 1;
   if (i < argc && strcmp(argv[i], "--json") == 0) st.json = true, ++i;
   if (i < argc && argv[i][0] == '-' && argv[i][1] != '\0') {
@@ -101,6 +103,7 @@ int cmd_list(int argc, char** argv) {
 
   readout_reader reader;
   if (readout_open(&reader, path, "list") != 0) return kExitBad;
+  st.prog = &reader.prog;
   dump_stream stream;
   dump_stream_init(&stream);
   device_extraction device;
