@@ -1,12 +1,9 @@
-// ramdump_inspect's dump stream parser, read-out reader and model of the tool's message
-// extraction. Byte 0 bit 0 pads the last unit to a whole one, bytes 1 and 2 give a piece size,
-// the rest is a dump stream. It must hold that:
-//   - the stream fed in pieces gives the same records, contents and end as fed whole, every
-//     content adds up to what its record's end reports, and records follow without gaps;
-//   - cut into payloads behind chain block headers and read back from a file, it gives what the
-//     payloads of the whole units give when parsed directly;
-//   - the model says RAMDUMP_MSG.txt comes out complete exactly when the real extraction writes
-//     a file of the size its last "Found file" line announced.
+// ramdump_inspect's dump stream parser and its model of the tool's message extraction. Byte 0
+// bit 0 pads the last unit to a whole one, bytes 1 and 2 give a piece size, the rest is a dump
+// stream. Fed in pieces, the stream must give the records, contents and end that it gives fed
+// whole, with every content adding up to what its record's end reports and no gaps between
+// records. Cut into units, the model must say RAMDUMP_MSG.txt comes out complete exactly when
+// the real extraction writes a file of the size its last "Found file" line announced.
 #include <stdlib.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
@@ -18,60 +15,52 @@
 
 #include "ramdump/dump_extract.h"
 #include "tests/fuzz/fuzz_common.h"
-#include "tools/ramdump_inspect/readout_reader.h"
+#include "tools/ramdump_inspect/dump_stream.h"
 
 namespace {
 
 std::string base_dir, message;
-unsigned long long found_size;  // what the real extraction last announced, with found
+unsigned long long found_size;  // what the real extraction last announced, when found
 bool found;
 
 struct recording {
-  std::string events, content;
+  std::string events;
   uint64_t next_offset = 0, received = 0;
 };
 
-int on_header(void* ctx, const dump_stream_record& r) {
-  recording& rec = *static_cast<recording*>(ctx);
-  if (r.offset != rec.next_offset) abort();
-  rec.events += "H" + std::to_string(r.offset) + "," + std::to_string(r.size) + "," +
-                std::string(reinterpret_cast<const char*>(r.name), sizeof(r.name));
-  rec.received = 0;
-  return 0;
-}
-
-int on_content(void* ctx, const uint8_t* data, size_t length) {
-  recording& rec = *static_cast<recording*>(ctx);
-  rec.content.append(reinterpret_cast<const char*>(data), length);
-  rec.received += length;
-  return 0;
-}
-
-int on_end(void* ctx, const dump_stream_record& r, bool complete, uint64_t received) {
-  recording& rec = *static_cast<recording*>(ctx);
-  if (received != rec.received || complete != (received == r.size)) abort();
-  rec.next_offset = r.offset + DUMP_FILE_RECORD_SIZE + r.size;
-  rec.events += "E" + std::to_string(received);
-  return 0;
-}
-
-void note_end(const dump_stream& s, recording* rec) {
-  rec->events += "|" + std::to_string(s.state) + "@" + std::to_string(s.end_offset) + " " +
-                 dump_stream_end_text(s);
-}
-
-recording parse(const std::string& stream, size_t piece) {
+std::string parse(const std::string& stream, size_t piece) {
   recording rec;
+  const dump_stream_sink sink = {
+      &rec,
+      [](void* ctx, const dump_stream_record& r) {
+        recording& rec = *static_cast<recording*>(ctx);
+        if (r.offset != rec.next_offset) abort();
+        rec.events += "H" + std::to_string(r.size) + ":" +
+                      std::string(reinterpret_cast<const char*>(r.name), sizeof(r.name));
+        rec.received = 0;
+        return 0;
+      },
+      [](void* ctx, const uint8_t* data, size_t length) {
+        recording& rec = *static_cast<recording*>(ctx);
+        rec.events.append(reinterpret_cast<const char*>(data), length);
+        rec.received += length;
+        return 0;
+      },
+      [](void* ctx, const dump_stream_record& r, bool complete, uint64_t received) {
+        recording& rec = *static_cast<recording*>(ctx);
+        if (received != rec.received || complete != (received == r.size)) abort();
+        rec.next_offset = r.offset + DUMP_FILE_RECORD_SIZE + r.size;
+        rec.events += "E" + std::to_string(received);
+        return 0;
+      }};
   dump_stream s;
   dump_stream_init(&s);
-  const dump_stream_sink sink = {&rec, on_header, on_content, on_end};
   for (size_t at = 0; at < stream.size(); at += piece) {
     dump_stream_feed(&s, reinterpret_cast<const uint8_t*>(stream.data()) + at,
                      std::min(piece, stream.size() - at), sink);
   }
   dump_stream_finish(&s, sink);
-  note_end(s, &rec);
-  return rec;
+  return rec.events + "|" + std::to_string(s.end_offset) + " " + dump_stream_end_text(s);
 }
 
 }  // namespace
@@ -92,37 +81,24 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (size < 3) return 0;
   const std::string stream(reinterpret_cast<const char*>(data) + 3, size - 3);
-  const recording whole = parse(stream, stream.size() + 1);
-  const recording pieces = parse(stream, 1 + ((data[1] | data[2] << 8) & 0x1FFF));
-  if (whole.events != pieces.events || whole.content != pieces.content) abort();
-
-  std::string readout, payloads;
+  if (parse(stream, stream.size() + 1) != parse(stream, 1 + ((data[1] | data[2] << 8) & 0x1FFF))) {
+    abort();
+  }
+  std::string readout;
+  device_extraction device;
+  device_extraction_init(&device);
   for (size_t at = 0; at < stream.size(); at += UNIT_PAYLOAD_SIZE) {
-    std::string payload = stream.substr(at, UNIT_PAYLOAD_SIZE);
-    if ((data[0] & 1) != 0) payload.resize(UNIT_PAYLOAD_SIZE, '\0');
-    if (payload.size() == UNIT_PAYLOAD_SIZE) payloads += payload;
-    readout += "BCho" + std::string(CHAIN_BLOCK_HEADER_SIZE - 4, '\0') + payload;
+    std::string unit = "BCho" + std::string(12, '\0') + stream.substr(at, UNIT_PAYLOAD_SIZE);
+    if ((data[0] & 1) != 0) unit.resize(UNIT_SIZE, '\0');
+    if (unit.size() == UNIT_SIZE)
+      device_extraction_feed(&device, reinterpret_cast<const uint8_t*>(unit.data()));
+    readout += unit;
   }
   const int fd = memfd_create("readout", MFD_CLOEXEC);
   if (write(fd, readout.data(), readout.size()) != static_cast<ssize_t>(readout.size())) abort();
-  const std::string path = "/proc/self/fd/" + std::to_string(fd);
-
-  recording read;
-  readout_reader reader;
-  dump_stream s;
-  dump_stream_init(&s);
-  device_extraction device;
-  device_extraction_init(&device);
-  if (readout_open(&reader, path.c_str(), "fuzz") != 0) abort();
-  readout_parse(&reader, &s, {&read, on_header, on_content, on_end}, &device, nullptr);
-  readout_close(&reader);
-  note_end(s, &read);
-  const recording direct = parse(payloads, payloads.size() + 1);
-  if (read.events != direct.events || read.content != direct.content) abort();
-
   reset_dump_filter_state_for_test();
   found = false;
-  extract_ramdump_msg(path.c_str(), base_dir.c_str());
+  extract_ramdump_msg(("/proc/self/fd/" + std::to_string(fd)).c_str(), base_dir.c_str());
   close(fd);
   struct stat st;
   const bool real = found && stat(message.c_str(), &st) == 0 &&

@@ -95,56 +95,53 @@ class InspectStream : public testing::Test {
 // what extract writes, and that strip writes the payloads of the good units.
 TEST_F(InspectStream, StreamsAndEndings) {
   struct Row {
-    std::string what;
     std::vector<Rec> recs;
-    std::string readout, end, err;
+    std::string readout, err;  // err: a part of list's standard error
+    uint64_t end;
+    const char* reason;
     int status, strip_status;
   };
   std::vector<Row> rows;
-  // A record header starting d bytes before the end of a payload, and a content over 3 units.
-  for (size_t d : {0, 1, 16, 17, 39, 40}) {
-    std::vector<Rec> recs = {{"memory0.bin", pattern(P - d - 40, 1)},
-                             {"kernel_log.bin", pattern(2 * P + 5, 2)},
-                             {"RAMDUMP_MSG.txt", pattern(100, 3)}};
-    const size_t end = 3 * P - d + 185;
-    rows.push_back({"header " + std::to_string(d) + " bytes before a unit's end", recs,
-                    readout_units(stream_of(recs)),
-                    "{\"offset\": " + std::to_string(end) + ", \"reason\": \"bad_magic\"", "", 0,
-                    0});
+  for (size_t d : {0, 1, 16, 17, 39, 40}) {  // a header d bytes before a unit's end
+    const std::vector<Rec> recs = {{"memory0.bin", pattern(P - d - 40, 1)},
+                                   {"kernel_log.bin", pattern(2 * P + 5, 2)},  // over 3 units
+                                   {"RAMDUMP_MSG.txt", pattern(100, 3)}};
+    rows.push_back({recs, readout_units(stream_of(recs)), "", 3 * P - d + 185, "bad_magic", 0, 0});
   }
+  const Row partial = {rows[1].recs,
+                       rows[1].readout + "xyz",
+                       "partial unit of 3 bytes at offset 16384",
+                       rows[1].end,
+                       "bad_magic",
+                       1,
+                       1};
   const std::vector<Rec> cut = {{"memory0.bin", pattern(5000, 4)},
-                                {"trace.bin", pattern(2 * P - 5080, 5), 9000}};
-  rows.push_back({"last record cut short", cut, readout_units(stream_of(cut)),
-                  "{\"offset\": 8160, \"reason\": \"end_of_data\"", "the data ends inside", 1, 0});
-  const std::vector<Rec> huge = {{"memory0.bin", pattern(P - 40, 6), ~0ull}};
-  rows.push_back({"size 2^64-1", huge, readout_units(stream_of(huge)),
-                  "{\"offset\": 4080, \"reason\": \"end_of_data\"",
-                  "the data ends inside a record at stream offset 4080", 1, 0});
-  std::string bad_chain = readout_units(stream_of({{"memory0.bin", pattern(6000, 7)}}));
-  bad_chain[P + 16] = 'X';  // chain magic of unit 1
-  rows.push_back({"bad chain magic inside a record",
-                  {{"memory0.bin", pattern(P - 40, 7), 6000}},
-                  bad_chain,
-                  "{\"offset\": 4080, \"reason\": \"bad_chain_magic\"",
-                  "unit 1 at offset 4096 has chain block magic 6f684358",
-                  1,
-                  1});
-  rows.push_back({"partial last unit", rows[1].recs, rows[1].readout + "xyz", rows[1].end,
-                  "partial unit of 3 bytes at offset 16384", 1, 1});
-  const std::vector<Rec> head = {{"memory0.bin", pattern(P - 60, 8)}};
-  rows.push_back(
-      {"record header cut short", head,
-       readout_units(stream_of(head) + dump_record("kernel_log.bin", 9, "").substr(0, 20)),
-       "{\"offset\": 4060, \"reason\": \"end_of_data\"",
-       "inside a record header at stream offset 4060", 1, 0});
-
+                                {"trace.bin", pattern(2 * P - 5080, 5), 9000}},
+                         huge = {{"memory0.bin", pattern(P - 40, 6), ~0ull}},
+                         chain = {{"memory0.bin", pattern(P - 40, 7), 6000}},
+                         head = {{"memory0.bin", pattern(P - 60, 8)}};
+  std::string bad_chain = readout_units(stream_of(chain) + pattern(1960, 7));
+  bad_chain[4096] = 'X';  // chain block magic of unit 1
+  const std::string cut_head = stream_of(head) + dump_record("kernel_log.bin", 9, "").substr(0, 20);
+  rows.insert(rows.end(),
+              {partial,
+               {cut, readout_units(stream_of(cut)), "inside a record at stream offset 8160", 8160,
+                "end_of_data", 1, 0},
+               {huge, readout_units(stream_of(huge)), "inside a record at stream offset 4080", 4080,
+                "end_of_data", 1, 0},
+               {chain, bad_chain, "unit 1 at offset 4096 has chain block magic 6f684358", 4080,
+                "bad_chain_magic", 1, 1},
+               {head, readout_units(cut_head), "inside a record header at stream offset 4060", 4060,
+                "end_of_data", 1, 0}});
   for (const Row& row : rows) {
-    SCOPED_TRACE(row.what);
+    SCOPED_TRACE(row.err + " " + std::to_string(row.end));
     write_host_file(readout_, row.readout);
     RunResult list = inspect("list --json " + readout_);
     EXPECT_EQ(list.status, row.status);
     EXPECT_EQ(list.out.substr(0, list.out.find("\"end\": ") + 7), records_json(row.recs));
-    EXPECT_TRUE(contains(list.out, row.end)) << list.out;
+    EXPECT_TRUE(contains(list.out, "{\"offset\": " + std::to_string(row.end) + ", \"reason\": \"" +
+                                       row.reason + "\""))
+        << list.out;
     EXPECT_TRUE(contains(list.err, row.err)) << list.err;
 
     fs::remove_all(dir_ + "/x");
