@@ -26,7 +26,7 @@ int readout_open(readout_reader* r, const char* path, const char* what) {
   r->path = path;
   r->fd = open(path, O_RDONLY | O_CLOEXEC);
   if (r->fd < 0) return fail(path, strerror(errno));
-  struct stat st;
+  struct stat st = {};
   if (fstat(r->fd, &st) != 0 || S_ISDIR(st.st_mode)) {
     const std::string why = S_ISDIR(st.st_mode) ? "is a directory" : strerror(errno);
     close(r->fd);
