@@ -65,10 +65,13 @@ class InspectStream : public testing::Test {
   }
   void TearDown() override { fs::remove_all(dir_); }
 
+  // Runs the built ramdump_inspect, under RB_TEST_WRAPPER (an emulator) when it is set.
   RunResult inspect(const std::string& args) {
-    const std::string err = dir_ + "/stderr";
-    FILE* p =
-        popen((std::string(RB_BUILD_DIR) + "/ramdump_inspect " + args + " 2>" + err).c_str(), "r");
+    const char* wrapper = getenv("RB_TEST_WRAPPER");
+    const std::string err = dir_ + "/stderr",
+                      command = std::string(wrapper != nullptr ? wrapper : "") + " " +
+                                RB_BUILD_DIR + "/ramdump_inspect " + args;
+    FILE* p = popen((command + " 2>" + err).c_str(), "r");
     RunResult r;
     char buf[4096];
     for (size_t n; (n = fread(buf, 1, sizeof(buf), p)) > 0;) r.out.append(buf, n);
