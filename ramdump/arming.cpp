@@ -1,5 +1,6 @@
 #include "ramdump/arming.h"
 
+#include <android-base/unique_fd.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <stdio.h>
@@ -9,6 +10,7 @@
 #include <unistd.h>
 
 #include "platform/log.h"
+#include "ramdump/block_device.h"
 #include "ramdump/block_map.h"
 #include "ramdump/retry_io.h"
 
@@ -18,19 +20,11 @@ constexpr size_t kCreateChunk = 65536;
 
 }  // namespace
 
-int create_file(const char* path, int64_t size, int progress) {
-  // Failures return without releasing the descriptor or the buffer: the process ends soon
-  // after, and the buffer is kept on success too.
-  // Without a path (no operand on the command line) the open fails as it would on a bad
-  // pointer.
-  int fd = -1;
-  if (path == nullptr) {
-    errno = EFAULT;
-  } else {
-    fd = open(path, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0660);
-  }
+int create_file(const file_ref& file, int64_t size, int progress) {
+  // The buffer is kept, also on success: the process ends soon after.
+  android::base::unique_fd fd(open_file(file, O_WRONLY | O_CREAT | O_TRUNC, 0660));
   if (fd < 0) {
-    RB_LOGE("failed to open file:%s for writing: %s\n", path != nullptr ? path : "(null)",
+    RB_LOGE("failed to open file:%s for writing: %s\n", file.path != nullptr ? file.path : "(null)",
             strerror(errno));
     return -1;
   }
@@ -52,7 +46,6 @@ int create_file(const char* path, int64_t size, int progress) {
   }
   if (progress) fprintf(stderr, "%d/%d\n", chunks, chunks);
   fsync(fd);
-  close(fd);
   return 0;
 }
 
@@ -100,10 +93,10 @@ void write_chain(int dev_fd, const int64_t* list, uint32_t count, uint8_t* buffe
   if (progress) fprintf(stderr, "%d/%d\n", static_cast<int>(count), static_cast<int>(count));
 }
 
-int raw_write_blocks(const char* block_file, const char* blk_dev, initial_block_header* ibh,
+int raw_write_blocks(const file_ref& block_file, const char* blk_dev, initial_block_header* ibh,
                      uint32_t initial_crc, int progress) {
-  // Failures before the first run is written return without releasing what was obtained:
-  // the process ends right after a failed arming.
+  // The buffers obtained before a failure are not released: the process ends right after a
+  // failed arming.
   int64_t block_size;
   uint32_t count;
   int64_t size;
@@ -115,19 +108,20 @@ int raw_write_blocks(const char* block_file, const char* blk_dev, initial_block_
     RB_LOGE("0 full blocks available in file\n");
     return -1;
   }
-  int fd = open(block_file, O_RDONLY | O_CLOEXEC);
+  android::base::unique_fd fd(open_file(block_file, O_RDONLY));
   if (fd < 0) {
     RB_LOGE("failed to open fd for reading: %s\n", strerror(errno));
     return -1;
   }
   // Delayed allocation must have placed every block before the blocks are mapped.
   fsync(fd);
-  int dev_fd = open(blk_dev, O_WRONLY | O_CLOEXEC);
+  android::base::unique_fd dev_fd(open_file(typed_path(blk_dev), O_WRONLY));
   if (dev_fd < 0) {
     RB_LOGE("failed to open blk_dev for writing: %s\n", strerror(errno));
     return -1;
   }
   RB_LOGI("Opened %s for writing\n", blk_dev);
+  if (check_device_holds_file(dev_fd, blk_dev, fd, block_file.path) != 0) return -1;
   int64_t* list = static_cast<int64_t*>(malloc(static_cast<size_t>(count) * sizeof(int64_t)));
   if (list == nullptr) {
     RB_LOGE("failed to allocate block list\n");
@@ -167,9 +161,9 @@ int raw_write_blocks(const char* block_file, const char* blk_dev, initial_block_
   }
   write_chain(dev_fd, list, count, buffer, block_size, initial_crc, progress);
 
-  close(fd);
+  fd.reset();
   fsync(dev_fd);
-  close(dev_fd);
+  dev_fd.reset();
   free(list);
   free(buffer);
   *ibh = header;

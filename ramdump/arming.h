@@ -5,18 +5,20 @@
 #include <stdint.h>
 
 #include "ramdump/chain_format.h"
+#include "ramdump/file_ref.h"
 
-// Creates or truncates path (mode 0660) and fills it with size bytes of 0xFF, 64 KiB at a
+// Creates or truncates the file (mode 0660) and fills it with size bytes of 0xFF, 64 KiB at a
 // time, so that the file system allocates real blocks for all of it. With progress, prints
 // "done/total" chunk lines on standard error every 16 MiB. Returns 0 or -1.
-int create_file(const char* path, int64_t size, int progress);
+int create_file(const file_ref& file, int64_t size, int progress);
 
 // Maps every block of block_file, then writes the chain's headers (followed by zeroed
 // payloads) into those blocks of blk_dev, one seek and one write per run of up to 1024
 // blocks. On success fills *ibh with the new chain's initial block header (state armed) and
-// returns 0; otherwise returns -1 and leaves *ibh untouched. A run that fails to be written
-// is logged but does not change the result: the integrity test shows a damaged chain.
-int raw_write_blocks(const char* block_file, const char* blk_dev, initial_block_header* ibh,
+// returns 0; otherwise returns -1 and leaves *ibh untouched, with nothing written when blk_dev
+// does not hold the file. A run that fails to be written is logged but does not change the
+// result: the integrity test shows a damaged chain.
+int raw_write_blocks(const file_ref& block_file, const char* blk_dev, initial_block_header* ibh,
                      uint32_t initial_crc, int progress);
 
 // Writes the chain over the block list (physical block of logical block i at index i, count

@@ -1,11 +1,16 @@
 #include "ramdump/auto_cycle.h"
 
+#include <android-base/stringprintf.h>
+#include <android-base/unique_fd.h>
 #include <errno.h>
 #include <fcntl.h>
+#include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
 #include <sys/statvfs.h>
 #include <unistd.h>
+
+#include <string>
 
 #include "fs_mgr/fs_mgr_fstab.h"
 #include "misc/misc_store.h"
@@ -15,7 +20,9 @@
 #include "ramdump/block_map.h"
 #include "ramdump/chain_format.h"
 #include "ramdump/dump_extract.h"
+#include "ramdump/file_ref.h"
 #include "ramdump/misc_flags.h"
+#include "ramdump/ramdump_dir.h"
 #include "ramdump/ramdump_names.h"
 #include "ramdump/read_out.h"
 
@@ -28,16 +35,45 @@ constexpr int kSpaceUnitShift = 31;                  // space is judged in whole
 
 uint64_t free_bytes_on_data() {
   struct statvfs vfs;
-  if (statvfs(RAMDUMP_DIR, &vfs) != 0) {
+  const int dir = ramdump_dir();
+  if (dir < 0 || fstatvfs(dir, &vfs) != 0) {
     RB_LOGE("Could not statvfs %s: %s\n", RAMDUMP_DIR, strerror(errno));
     return 0;
   }
   return static_cast<uint64_t>(vfs.f_bavail) * static_cast<uint64_t>(vfs.f_bsize);
 }
 
+std::string fd_path(int fd) { return android::base::StringPrintf("/proc/self/fd/%d", fd); }
+
+// The message file is extracted into a private directory and then moved into the output
+// directory, so that a link planted there during the read-out is replaced, never followed.
+void extract_message(const file_ref& output) {
+  android::base::unique_fd readout(open_file(output, O_RDONLY));
+  // What is not the read-out's own file is not read (the read-out has said why); a missing
+  // one is reported by the extraction.
+  if (readout < 0 && errno != ENOENT) return;
+  const std::string from = readout >= 0 ? fd_path(readout) : RAMDUMP_OUTPUT_PATH;
+  std::string stage = fd_path(ramdump_dir()) + "/." RAMDUMP_MSG_NAME ".XXXXXX";
+  const bool made = mkdtemp(&stage[0]) != nullptr;
+  android::base::unique_fd staged(made ? open_dir_at(AT_FDCWD, stage.c_str()) : -1);
+  // Without room for one more directory the message goes straight to the output directory.
+  const std::string to = staged >= 0          ? fd_path(staged)
+                         : output.dir_fd >= 0 ? fd_path(output.dir_fd)
+                                              : RAMDUMP_OUTPUT_DIR;
+  extract_ramdump_msg(from.c_str(), to.c_str());
+  struct stat st;
+  if (staged >= 0 && fstatat(staged, RAMDUMP_MSG_NAME, &st, AT_SYMLINK_NOFOLLOW) == 0 &&
+      renameat(staged, RAMDUMP_MSG_NAME, output.dir_fd, RAMDUMP_MSG_NAME) != 0) {
+    RB_LOGE("Could not move %s into place: %s\n", RAMDUMP_MSG_PATH, strerror(errno));
+    unlinkat(staged, RAMDUMP_MSG_NAME, 0);
+  }
+  if (made) unlinkat(ramdump_dir(), strrchr(stage.c_str(), '/') + 1, AT_REMOVEDIR);
+}
+
 // The stored header is marked armed without a dump before anything is read out, so that a
 // dump that breaks the read-out is not offered again at the next boot.
-int read_out_and_rearm(const char* blk_dev, initial_block_header* ibh, uint32_t progress) {
+int read_out_and_rearm(const file_ref& reserved, const char* blk_dev, initial_block_header* ibh,
+                       uint32_t progress) {
   uint8_t raw[INITIAL_BLOCK_HEADER_SIZE];
   const uint32_t old_state = ibh->state;
   ibh->state = (old_state & ~(STATE_ARMED | STATE_DUMP_PRESENT)) | STATE_ARMED;
@@ -50,17 +86,14 @@ int read_out_and_rearm(const char* blk_dev, initial_block_header* ibh, uint32_t 
     RB_LOGE("No ramdump found, exiting\n");
     return -1;
   }
-  unlink(RAMDUMP_OUTPUT_PATH);
-  unlink(RAMDUMP_MSG_PATH);
-  rmdir(RAMDUMP_OUTPUT_DIR);
-  mkdir(RAMDUMP_OUTPUT_PARENT, 0777);
-  mkdir(RAMDUMP_OUTPUT_DIR, 0777);
-  int result = raw_read_blocks(RAMDUMP_RESERVED_PATH, blk_dev, RAMDUMP_OUTPUT_PATH);
+  const int out_dir = recreate_output_dir();
+  const file_ref output{RAMDUMP_OUTPUT_PATH, RAMDUMP_OUTPUT_NAME, out_dir, out_dir < 0 ? errno : 0};
+  android::base::unique_fd out_dir_holder(out_dir);
+  int result = raw_read_blocks(reserved, blk_dev, output);
   if (result != 0) RB_LOGE("Failed to read out ramdump from reserved blocks\n");
-  extract_ramdump_msg(RAMDUMP_OUTPUT_PATH, RAMDUMP_OUTPUT_DIR);
+  extract_message(output);
   // Re-armed even after a failed read-out: the chain must be ready for the next crash.
-  raw_write_blocks(RAMDUMP_RESERVED_PATH, blk_dev, ibh, ibh->initial_crc,
-                   static_cast<int>(progress));
+  raw_write_blocks(reserved, blk_dev, ibh, ibh->initial_crc, static_cast<int>(progress));
   encode_initial_block_header(*ibh, raw);
   if (MISC_write_RamdumpIBH(raw) != 0) {
     RB_LOGE("Failed to write new initial block header to MISC partition\n");
@@ -73,15 +106,22 @@ int read_out_and_rearm(const char* blk_dev, initial_block_header* ibh, uint32_t 
 int process_auto_ramdump(uint32_t initial_crc, uint32_t progress) {
   const uint64_t free_bytes = free_bytes_on_data();
   const uint64_t units = free_bytes >> kSpaceUnitShift;
-  const bool present = access(RAMDUMP_RESERVED_PATH, R_OK | W_OK) == 0;
+  const file_ref reserved = in_ramdump_dir(RAMDUMP_RESERVED_NAME, RAMDUMP_RESERVED_PATH);
+  // Anything else at its name is neither present nor missing: its blocks are not ours.
+  struct stat st;
+  if (stat_file(reserved, &st) == 0 && !usable_fixed_file(st, RAMDUMP_RESERVED_PATH)) return -1;
+  const bool present =
+      reserved.dir_fd >= 0 && faccessat(reserved.dir_fd, reserved.name, R_OK | W_OK, 0) == 0;
   bool newly_created = false;
   bool enough_space;
   if (!present) {
     enough_space = units >= (kSpaceToCreate >> kSpaceUnitShift);
     if (enough_space) {
-      int rc = create_file(RAMDUMP_RESERVED_PATH, kReservedFileSize, static_cast<int>(progress));
+      int rc = create_file(reserved, kReservedFileSize, static_cast<int>(progress));
       if (rc < 0) return rc;
-      chmod(RAMDUMP_RESERVED_PATH, 0744);
+      // chmod, without following a link planted meanwhile; the result is ignored.
+      android::base::unique_fd created(open_file(reserved, O_RDONLY));
+      if (created >= 0) fchmod(created, 0744);
       newly_created = true;
     } else {
       RB_LOGE(
@@ -115,7 +155,7 @@ int process_auto_ramdump(uint32_t initial_crc, uint32_t progress) {
   }
 
   int result = -1;
-  int fd = open(RAMDUMP_RESERVED_PATH, O_RDONLY | O_SYNC | O_CLOEXEC);
+  android::base::unique_fd fd(open_file(reserved, O_RDONLY | O_SYNC));
   if (fd < 0) {
     RB_LOGE("Failed to open %s for reading; %s\n", RAMDUMP_RESERVED_PATH, strerror(errno));
   } else {
@@ -131,18 +171,18 @@ int process_auto_ramdump(uint32_t initial_crc, uint32_t progress) {
       initial_block_header ibh = decode_initial_block_header(raw);
       if (newly_created) {
         // A first arming reports failure on purpose: there was no dump to collect.
-        if (raw_write_blocks(RAMDUMP_RESERVED_PATH, blk_dev, &ibh, initial_crc,
-                             static_cast<int>(progress)) == 0) {
+        if (raw_write_blocks(reserved, blk_dev, &ibh, initial_crc, static_cast<int>(progress)) ==
+            0) {
           encode_initial_block_header(ibh, raw);
           if (MISC_write_RamdumpIBH(raw) != 0) {
             RB_LOGE("Failed to write initial block header to MISC partition\n");
           }
         }
       } else {
-        result = read_out_and_rearm(blk_dev, &ibh, progress);
+        result = read_out_and_rearm(reserved, blk_dev, &ibh, progress);
       }
     }
-    close(fd);
+    fd.reset();
   }
   fs_mgr_free_fstab(table);
   return result;

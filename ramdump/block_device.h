@@ -16,3 +16,10 @@ const char* find_block_device(const char* path, const fstab* table, int* encrypt
 // that the table or the device was not found (a table already loaded is not released).
 int resolve_block_device(const char* path, fstab** table, const char** blk_dev, int* encryptable,
                          int* encrypted);
+
+// Whether the raw device (dev_fd, opened from blk_dev) holds the file system of the file
+// (file_fd, named file in messages): the same device, or a device-mapper device whose only
+// slave it is (full-disk encryption puts /data on dm-crypt over the userdata partition, sector
+// for sector). Otherwise logs that the device does not hold the file and returns -1, before
+// anything on the device has been read or written; 0 when it does.
+int check_device_holds_file(int dev_fd, const char* blk_dev, int file_fd, const char* file);

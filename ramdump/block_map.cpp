@@ -11,10 +11,10 @@
 
 static_assert(FIBMAP == 1, "the block-mapping ioctl is request 1");
 
-int stat_block_file(const char* path, int64_t* block_size, uint32_t* count, int64_t* size) {
+int stat_block_file(const file_ref& file, int64_t* block_size, uint32_t* count, int64_t* size) {
   struct stat st;
-  if (stat(path, &st) != 0) {
-    RB_LOGE("failed to stat %s: %s\n", path, strerror(errno));
+  if (stat_file(file, &st) != 0) {
+    RB_LOGE("failed to stat %s: %s\n", file.path, strerror(errno));
     return -1;
   }
   *block_size = static_cast<int32_t>(st.st_blksize);

@@ -1,17 +1,23 @@
 #include "ramdump/boot_entry.h"
 
+#include <android-base/strings.h>
+#include <android-base/unique_fd.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <string.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <string>
+
 #include "misc/misc_store.h"
 #include "platform/log.h"
 #include "platform/properties.h"
 #include "ramdump/auto_cycle.h"
+#include "ramdump/file_ref.h"
 #include "ramdump/le_bytes.h"
 #include "ramdump/misc_flags.h"
+#include "ramdump/ramdump_dir.h"
 #include "ramdump/ramdump_names.h"
 
 namespace {
@@ -27,22 +33,24 @@ void publish_cycle_result(int result) {
   }
 }
 
-// Reads the start of the request file into a zeroed buffer; false when it cannot be opened
-// or read.
-bool read_request(char (&text)[1024]) {
-  memset(text, 0, sizeof(text));
-  int fd = open(RAMDUMP_STATUS_PATH, O_RDONLY | O_CLOEXEC);
-  if (fd < 0) return false;
-  ssize_t n = read(fd, text, sizeof(text));
-  close(fd);
-  return n >= 0;
+// The start of the request file, "" when it cannot be opened or read. One read of at most 1024
+// bytes, not ReadFileToString: the file is writable by everyone and may be made huge.
+std::string read_request() {
+  char text[1024];
+  android::base::unique_fd fd(
+      open_file(in_ramdump_dir(RAMDUMP_STATUS_NAME, RAMDUMP_STATUS_PATH), O_RDONLY));
+  ssize_t n = fd < 0 ? -1 : read(fd, text, sizeof(text));
+  return n > 0 ? std::string(text, static_cast<size_t>(n)) : std::string();
 }
 
 // An empty request file, readable and writable by everyone, lets the platform ask for the
 // feature to be switched with a plain write.
 void ensure_request_file() {
-  if (access(RAMDUMP_STATUS_PATH, R_OK | W_OK) == 0) return;
-  int fd = open(RAMDUMP_STATUS_PATH, O_RDWR | O_CREAT | O_CLOEXEC, 0666);
+  const file_ref status = in_ramdump_dir(RAMDUMP_STATUS_NAME, RAMDUMP_STATUS_PATH);
+  struct stat st;
+  if (stat_file(status, &st) == 0 && !usable_fixed_file(st, RAMDUMP_STATUS_PATH)) return;
+  if (status.dir_fd >= 0 && faccessat(status.dir_fd, status.name, R_OK | W_OK, 0) == 0) return;
+  android::base::unique_fd fd(open_file(status, O_RDWR | O_CREAT, 0666));
   if (fd < 0) {
     RB_LOGE("Could not create file %s: %s\n", RAMDUMP_STATUS_PATH, strerror(errno));
     return;
@@ -50,19 +58,17 @@ void ensure_request_file() {
   if (fchmod(fd, 0666) != 0) {
     RB_LOGE("Could not chmod %s: %s\n", RAMDUMP_STATUS_PATH, strerror(errno));
   }
-  close(fd);
 }
 
 // Applies a "disable" or "enable" request; -1 when the misc partition cannot be written.
 int apply_request_file() {
-  char text[1024];
-  if (read_request(text) && strncmp(text, "disable", 7) == 0) {
+  if (android::base::StartsWith(read_request(), "disable")) {
     RB_LOGI("Disabling ramdump\n");
     if (write_disabled_ibh() != 0 || write_enable_flag(RAMDUMP_DISABLED) != 0) {
       RB_LOGE("Failed to disable ramdump\n");
       return -1;
     }
-  } else if (read_request(text) && strncmp(text, "enable", 6) == 0) {
+  } else if (android::base::StartsWith(read_request(), "enable")) {
     RB_LOGI("Enabling ramdump\n");
     if (write_enable_flag(RAMDUMP_ENABLED) != 0) {
       RB_LOGE("Failed to enable ramdump\n");
@@ -76,13 +82,12 @@ int apply_request_file() {
 int delete_ramdump_files() {
   property_set(PROP_KVDUMP, "fail");
   RB_LOGI("Ramdump is disabled, deleting ramdump reserved file: %s\n", RAMDUMP_RESERVED_PATH);
-  int rc = unlink(RAMDUMP_RESERVED_PATH);
+  const int dir = ramdump_dir();
+  int rc = dir < 0 ? -1 : unlinkat(dir, RAMDUMP_RESERVED_NAME, 0);
   if (rc != 0) RB_LOGE("Failed to delete %s: %s\n", RAMDUMP_RESERVED_PATH, strerror(errno));
   RB_LOGI("Ramdump is disabled, deleting ramdump output file: %s\n", RAMDUMP_OUTPUT_PATH);
-  unlink(RAMDUMP_OUTPUT_PATH);
-  unlink(RAMDUMP_MSG_PATH);
-  rmdir(RAMDUMP_OUTPUT_DIR);
-  rmdir(RAMDUMP_OUTPUT_PARENT);
+  remove_collected_dump();
+  if (dir >= 0) unlinkat(dir, RAMDUMP_OUTPUT_PARENT_NAME, AT_REMOVEDIR);
   return rc == 0 ? 0 : -1;
 }
 
@@ -94,6 +99,7 @@ bool is_enable_full(int argc, char** argv) {
 }
 
 int run_enable_full(uint32_t initial_crc) {
+  lock_ramdump_dir();
   write_enable_flag(RAMDUMP_ENABLED);  // a failure is logged and the cycle runs anyway
   property_set(PROP_KVDUMP, "running");
   publish_cycle_result(process_auto_ramdump(initial_crc, 0));
@@ -101,12 +107,13 @@ int run_enable_full(uint32_t initial_crc) {
 }
 
 int run_auto_mode(const ramdump_options& options) {
+  lock_ramdump_dir();
   uint8_t lba[4];
   put_le32(lba, RAMDUMP_LBA_DISABLED);
   if (MISC_write_RamdumpLBA(lba) != 0) {
     RB_LOGE("error writing ramdump disable lba to MISC partition\n");
-  } else {
-    unlink(RAMDUMP_KVDUMP_PATH);
+  } else if (ramdump_dir() >= 0) {
+    unlinkat(ramdump_dir(), RAMDUMP_KVDUMP_NAME, 0);
   }
   ensure_request_file();
   if (apply_request_file() != 0) return -1;

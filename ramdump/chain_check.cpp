@@ -1,17 +1,20 @@
 #include "ramdump/chain_check.h"
 
+#include <android-base/unique_fd.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <string.h>
 #include <unistd.h>
 
 #include "platform/log.h"
+#include "ramdump/block_device.h"
 #include "ramdump/block_map.h"
 #include "ramdump/chain_format.h"
 #include "ramdump/retry_io.h"
 
 int test_block_chain(const char* block_file, const char* blk_dev, uint32_t initial_crc) {
-  int fd = open(block_file, O_RDONLY | O_SYNC | O_CLOEXEC);
+  // Kept open until the device is known to hold it; nothing depends on when it is closed.
+  android::base::unique_fd fd(open_file(typed_path(block_file), O_RDONLY | O_SYNC));
   if (fd < 0) {
     RB_LOGE("failed to open %s for reading: %s\n", block_file, strerror(errno));
     return -1;
@@ -21,21 +24,21 @@ int test_block_chain(const char* block_file, const char* blk_dev, uint32_t initi
     RB_LOGE("Failed to get block 0 for file %s: %s\n", block_file, strerror(errno));
     first = 0;
   }
-  close(fd);
   int64_t block_size;
   uint32_t file_blocks;  // not used: the walk follows the links, not the file
   int64_t size;
-  if (stat_block_file(block_file, &block_size, &file_blocks, &size) != 0) return -1;
+  if (stat_block_file(typed_path(block_file), &block_size, &file_blocks, &size) != 0) return -1;
   RB_LOGI(" block size: %ld bytes\n", static_cast<long>(block_size));
-  int dev_fd = open(blk_dev, O_RDONLY | O_SYNC | O_CLOEXEC);
+  android::base::unique_fd dev_fd(open_file(typed_path(blk_dev), O_RDONLY | O_SYNC));
   if (dev_fd < 0) {
     RB_LOGE("failed to open blk_dev:%s for reading: %s\n", blk_dev, strerror(errno));
     return -1;
   }
   RB_LOGI("Opened %s for reading\n", blk_dev);
+  if (check_device_holds_file(dev_fd, blk_dev, fd, block_file) != 0) return -1;
+  fd.reset();
   if (first == 0) {
     RB_LOGI("Read %d blocks successfully\n", 0);
-    close(dev_fd);
     return 0;
   }
 
@@ -69,7 +72,6 @@ int test_block_chain(const char* block_file, const char* blk_dev, uint32_t initi
     if (h.next_block == 0) {
       RB_LOGI("Read %d blocks successfully\n", static_cast<int>(count));
       if (mismatch) RB_LOGW("Integrity of chain not verified due to CRC mismatch\n");
-      close(dev_fd);
       return 0;
     }
     block = h.next_block;

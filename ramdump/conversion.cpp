@@ -11,6 +11,8 @@
 #include "ramdump/arming.h"
 #include "ramdump/block_device.h"
 #include "ramdump/chain_check.h"
+#include "ramdump/file_ref.h"
+#include "ramdump/ramdump_dir.h"
 #include "ramdump/read_out.h"
 #include "ramdump/usage.h"
 
@@ -18,8 +20,11 @@ int run_conversion(const ramdump_options& options, const char* program) {
   // Without an operand the run goes on and fails at the first step that needs the path.
   const char* path = options.block_file;
   if (path == nullptr) print_usage(program);
+  // The reserved file is the boot-time run's: one run at a time works on it.
+  if (is_reserved_file(path)) lock_ramdump_dir();
   if (options.create) {
-    int rc = create_file(path, static_cast<int64_t>(options.create_size), options.progress);
+    int rc =
+        create_file(typed_path(path), static_cast<int64_t>(options.create_size), options.progress);
     if (rc < 0) return rc;
   }
   char absolute[PATH_MAX];
@@ -47,8 +52,9 @@ int run_conversion(const ramdump_options& options, const char* program) {
   // A read-out fills no header: the lines below then show zeros.
   initial_block_header ibh = {};
   int rc = options.read_out_path != nullptr
-               ? raw_read_blocks(absolute, blk_dev, options.read_out_path)
-               : raw_write_blocks(absolute, blk_dev, &ibh, options.initial_crc, options.progress);
+               ? raw_read_blocks(typed_path(absolute), blk_dev, typed_path(options.read_out_path))
+               : raw_write_blocks(typed_path(absolute), blk_dev, &ibh, options.initial_crc,
+                                  options.progress);
   if (rc != 0) return rc;
   RB_LOGI("Success\n");
   printf("%s\n", blk_dev);

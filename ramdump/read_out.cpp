@@ -1,5 +1,7 @@
 #include "ramdump/read_out.h"
 
+#include <android-base/file.h>
+#include <android-base/unique_fd.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <stdint.h>
@@ -8,6 +10,7 @@
 #include <unistd.h>
 
 #include "platform/log.h"
+#include "ramdump/block_device.h"
 #include "ramdump/block_map.h"
 #include "ramdump/retry_io.h"
 
@@ -31,27 +34,15 @@ int copy_block(int dev_fd, int out_fd, uint32_t block, int64_t block_size, uint8
   return 0;
 }
 
-// Reads exactly length bytes; false on an error or an early end, which the caller handles
-// by going block by block.
-bool read_whole(int fd, uint8_t* p, size_t length) {
-  while (length > 0) {
-    ssize_t n = read(fd, p, length);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    p += n;
-    length -= static_cast<size_t>(n);
-  }
-  return true;
-}
-
-// n physically consecutive blocks from first. When the device delivers them all they are
-// copied in one piece; otherwise block by block, so that a read error or an early end of the
-// device leaves the same output and the same messages as a copy one block at a time.
+// n physically consecutive blocks from first. When the device delivers them all (an error or
+// an early end makes ReadFully fail) they are copied in one piece; otherwise block by block, so
+// that a read error or an early end of the device leaves the same output and the same messages as a
+// copy one block at a time.
 int copy_run(int dev_fd, int out_fd, uint32_t first, uint32_t n, int64_t block_size, uint8_t* buf,
              uint8_t* run_buf) {
   const size_t bytes = static_cast<size_t>(n * block_size);
   if (n > 1 && seek_retry(dev_fd, static_cast<off64_t>(first) * block_size) >= 0 &&
-      read_whole(dev_fd, run_buf, bytes)) {
+      android::base::ReadFully(dev_fd, run_buf, bytes)) {
     if (write_retry(out_fd, run_buf, bytes) < 0) return -1;
     // As after a copy block by block, the one-block buffer holds the last block.
     memcpy(buf, run_buf + bytes - block_size, static_cast<size_t>(block_size));
@@ -65,38 +56,39 @@ int copy_run(int dev_fd, int out_fd, uint32_t first, uint32_t n, int64_t block_s
 
 }  // namespace
 
-int raw_read_blocks(const char* block_file, const char* blk_dev, const char* out_file) {
+int raw_read_blocks(const file_ref& block_file, const char* blk_dev, const file_ref& out_file) {
   int64_t block_size;
   uint32_t count;
   int64_t size;
   if (stat_block_file(block_file, &block_size, &count, &size) != 0) return -1;
 
-  // The early failures below return without releasing what is already open: the process
-  // ends right after a failed read-out.
+  // The buffer is not released after an early failure: the process ends right after a failed
+  // read-out.
   uint8_t* buf = static_cast<uint8_t*>(malloc(static_cast<size_t>(block_size)));
   if (buf == nullptr) {
     RB_LOGE("failed to allocate block buffer\n");
     return -1;
   }
-  int in_fd = open(block_file, O_RDONLY | O_CLOEXEC);
+  android::base::unique_fd in_fd(open_file(block_file, O_RDONLY));
   if (in_fd < 0) {
-    RB_LOGE("failed to open infile:%s for reading: %s\n", block_file, strerror(errno));
+    RB_LOGE("failed to open infile:%s for reading: %s\n", block_file.path, strerror(errno));
     return -1;
   }
   // Delayed allocation must have placed every block before the blocks are mapped.
   fsync(in_fd);
-  int dev_fd = open(blk_dev, O_RDONLY | O_SYNC | O_CLOEXEC);
+  android::base::unique_fd dev_fd(open_file(typed_path(blk_dev), O_RDONLY | O_SYNC));
   if (dev_fd < 0) {
     RB_LOGE("failed to open blk_dev:%s for reading: %s\n", blk_dev, strerror(errno));
     return -1;
   }
   RB_LOGI("Opened %s for reading\n", blk_dev);
-  int out_fd = open(out_file, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666);
+  if (check_device_holds_file(dev_fd, blk_dev, in_fd, block_file.path) != 0) return -1;
+  android::base::unique_fd out_fd(open_file(out_file, O_WRONLY | O_CREAT | O_TRUNC, 0666));
   if (out_fd < 0) {
-    RB_LOGE("failed to open outfile:%s for writing: %s\n", out_file, strerror(errno));
+    RB_LOGE("failed to open outfile:%s for writing: %s\n", out_file.path, strerror(errno));
     return -1;
   }
-  RB_LOGI("Opened %s for writing\n", out_file);
+  RB_LOGI("Opened %s for writing\n", out_file.path);
 
   // Without room for a whole run the copy simply goes one block at a time.
   uint32_t run_blocks = block_size < kRunBytes ? static_cast<uint32_t>(kRunBytes / block_size) : 1;
@@ -150,10 +142,10 @@ int raw_read_blocks(const char* block_file, const char* blk_dev, const char* out
       break;
     }
   }
-  close(in_fd);
-  close(dev_fd);
+  in_fd.reset();
+  dev_fd.reset();
   fsync(out_fd);
-  close(out_fd);
+  out_fd.reset();
   free(run_buf);
   free(buf);
   return result;

@@ -3,7 +3,10 @@
 // physical blocks behind the file system's back.
 #pragma once
 
+#include "ramdump/file_ref.h"
+
 // Every block of block_file, mapped to its physical block, read from blk_dev and appended to
 // out_file (created with mode 0666), each block whole with its chain header. Returns 0, or -1
-// after logging the failure; a partly written out file stays.
-int raw_read_blocks(const char* block_file, const char* blk_dev, const char* out_file);
+// after logging the failure; a partly written out file stays. When blk_dev does not hold the
+// block file, nothing is read and no out file is made.
+int raw_read_blocks(const file_ref& block_file, const char* blk_dev, const file_ref& out_file);

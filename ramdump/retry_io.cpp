@@ -1,5 +1,6 @@
 #include "ramdump/retry_io.h"
 
+#include <android-base/file.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <string.h>
@@ -7,6 +8,7 @@
 
 #include "platform/log.h"
 
+// Not ReadFully: an early end of the file is no error here.
 int read_retry(int fd, void* buf, size_t length) {
   char* p = static_cast<char*>(buf);
   while (length > 0) {
@@ -24,16 +26,9 @@ int read_retry(int fd, void* buf, size_t length) {
 }
 
 int write_retry(int fd, const void* buf, size_t length) {
-  const char* p = static_cast<const char*>(buf);
-  while (length > 0) {
-    ssize_t n = write(fd, p, length);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      RB_LOGE("error writing: %s\n", strerror(errno));
-      return -1;
-    }
-    p += n;
-    length -= static_cast<size_t>(n);
+  if (!android::base::WriteFully(fd, buf, length)) {
+    RB_LOGE("error writing: %s\n", strerror(errno));
+    return -1;
   }
   return 0;
 }
