@@ -1,0 +1,328 @@
+// A hostile file system around the fixed paths, run as the real binary in the fake device root:
+// links, FIFOs and extra hard links where the boot-time run expects its own files, a mount
+// table whose device does not hold the file, a device-mapper device over the raw device, and
+// runs that meet on the reserved file. Every row must end in time and leave every byte outside
+// the tool's own files as it was: victim files on /data and on a second ext4 file system, their
+// blocks on the raw /data device, and the reserved blocks on the second file system's device.
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/file.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <functional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "ramdump/chain_format.h"
+#include "tests/harness/chain_checks.h"
+#include "tests/harness/fake_device.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+const std::string kDir = "/data/vendor/ramdump/";
+const std::string kReserved = kDir + "RAMDUMP_RESERVED", kStatus = kDir + "RAMDUMP_STATUS",
+                  kOutDir = kDir + "apq/00", kFifo = kDir + "fifo";
+const char kOther[] = "/dev/block/other";  // the second file system's raw device
+const uint32_t kCount = 64;
+
+std::string device_name(dev_t dev) {
+  return std::to_string(major(dev)) + ":" + std::to_string(minor(dev));
+}
+
+std::string raw_at(const std::string& device, const std::vector<long>& blocks) {
+  std::string bytes(blocks.size() * 4096, '\0');
+  int fd = open(device.c_str(), O_RDONLY | O_CLOEXEC);
+  for (size_t i = 0; i < blocks.size(); ++i) pread(fd, &bytes[i * 4096], 4096, blocks[i] * 4096);
+  close(fd);
+  return bytes;
+}
+
+// The chain as the firmware follows it from the stored initial block header: the number of
+// blocks whose magic and CRC are right, or -1 at the first that is not. The device is read 1 MiB
+// at a time: most links lead to the next block.
+long walk_chain(const std::string& device, const std::string& stored_header) {
+  const initial_block_header ibh =
+      decode_initial_block_header(reinterpret_cast<const uint8_t*>(stored_header.data()));
+  int fd = open(device.c_str(), O_RDONLY | O_CLOEXEC);
+  std::string window;
+  uint32_t crc = ibh.initial_crc, start = 0;
+  long count = 0;
+  for (uint32_t block = ibh.first_block; block != 0 && count >= 0 && count <= ibh.block_count;) {
+    if (window.empty() || block < start || block - start >= 256) {
+      start = block;
+      window.assign(256 * 4096, '\0');
+      window.resize(std::max(0l, pread(fd, &window[0], window.size(), start * 4096ll)));
+    }
+    const size_t at = (block - start) * 4096ull;
+    const auto* raw = reinterpret_cast<const uint8_t*>(window.data() + at);
+    const chain_block_header h = decode_chain_block_header(raw);
+    crc = chain_crc(crc, block, h.next_block);
+    count =
+        at + 16 <= window.size() && h.magic == CHAIN_BLOCK_MAGIC && h.crc == crc ? count + 1 : -1;
+    block = h.next_block;
+  }
+  close(fd);
+  return count;
+}
+
+void shell(const std::string& command) { ASSERT_EQ(system(command.c_str()), 0) << command; }
+
+// /data with a victim file and an empty directory, a second ext4 file system at /mnt with a
+// victim file and its device at kOther, and a small reserved file that holds a stored dump.
+struct Fixture {
+  FakeDevice d{16ull << 30};
+  std::string other;                        // host node of the second device
+  std::vector<long> reserved, victim, mnt;  // blocks of the reserved file and the victims
+
+  void set_up() {
+    // The same geometry as /data, so that the reserved file's blocks are data blocks there too.
+    char image[] = "/tmp/rb-other.XXXXXX";
+    close(mkstemp(image));
+    fs::resize_file(image, 16ull << 30);
+    fs::create_directories(d.host_path("/mnt"));
+    shell("mkfs.ext4 -q -F -m 0 -b 4096 " + std::string(image) + " && mount -o loop,noatime " +
+          image + " " + d.host_path("/mnt") + " && rm " + image);
+    struct stat st;
+    ASSERT_EQ(stat(d.host_path("/mnt").c_str(), &st), 0);
+    other = "/dev/loop" + std::to_string(minor(st.st_dev));
+    ASSERT_EQ(mknod(d.host_path(kOther).c_str(), S_IFBLK | 0600, st.st_dev), 0);
+    d.write_file("/data/victim", std::string(kCount * 4096, 'V'), 0600);
+    victim = map_file(d, "/data/victim", kCount);
+    d.write_file("/mnt/before", std::string(kCount * 4096, 'W'));  // other blocks than victim's
+    d.write_file("/mnt/victim", std::string(kCount * 4096, 'W'), 0600);
+    mnt = map_file(d, "/mnt/victim", kCount);
+  }
+
+  // The feature enabled, the reserved file armed with a dump stored by the firmware.
+  void prepare() {
+    system(("chattr -i " + d.host_path(kOutDir) + " 2>/dev/null").c_str());
+    for (const std::string& path : {kReserved, kStatus, kFifo, kFifo + ".out", kDir + "apq",
+                                    std::string("/data/absent"), std::string("/data/elsewhere")}) {
+      fs::remove_all(d.host_path(path));
+    }
+    fs::create_directories(d.host_path("/data/elsewhere"));
+    // A row that fails must not hide the next one's damage behind its own.
+    for (long block : victim) d.write_raw(block * 4096ull, std::string(4096, 'V'));
+    set_fstab(USERDATA_DEVICE);
+    d.write_file(kReserved, std::string(kCount * 4096, '\xFF'), 0744);
+    ASSERT_EQ(d.run({"-i", "5eed", kReserved}).status, 0) << d.log();
+    reserved = map_file(d, kReserved, kCount);
+    write_host_file(
+        d.misc_host_path(),
+        d.misc_bytes().replace(3184, 24, make_ibh(reserved[0], 4096, kCount, 0x5eed, 1)));
+    d.write_file("/tmp/RAMDUMP_MSG.txt", "watchdog timeout\n");
+    ASSERT_EQ(d.run({MISC_DEVICE, USERDATA_DEVICE, "/tmp/RAMDUMP_MSG.txt"}, "firmware_sim").status,
+              0);
+    d.write_file(kStatus, "", 0666);
+    d.set_property("debug.kvo.kvdump", "");
+    d.clear_log();
+  }
+
+  // Every byte that no run may change.
+  std::string untouchable() const {
+    return d.read_file("/data/victim") + d.read_file("/mnt/victim") +
+           raw_at(d.data_device(), victim) + raw_at(d.data_device(), mnt) + raw_at(other, reserved);
+  }
+
+  void set_fstab(const std::string& device) {
+    d.write_file("/vendor/etc/fstab.rbtest", device + " /data ext4 noatime wait\n");
+  }
+  void link(const std::string& target, const std::string& path) {
+    d.remove(path);
+    fs::create_directories(fs::path(d.host_path(path)).parent_path());
+    fs::create_symlink(target, d.host_path(path));
+  }
+  // A link at a name inside apq/00 that the run cannot remove: it is there when the output is
+  // written, as if planted after the old output was deleted.
+  void pinned_link(const std::string& name, const std::string& regular = "") {
+    if (!regular.empty()) d.write_file(kOutDir + "/" + regular, "old");
+    link("/data/victim", kOutDir + "/" + name);
+    shell("chattr +i " + d.host_path(kOutDir));
+  }
+  void fifo(const std::string& path) {
+    d.remove(path);
+    ASSERT_EQ(mkfifo(d.host_path(path).c_str(), 0666), 0);
+  }
+};
+
+TEST(HostilePaths, NothingOutsideTheToolsFilesChanges) {
+  Fixture f;
+  REQUIRE_DEVICE(f.d);
+  ASSERT_NO_FATAL_FAILURE(f.set_up());
+  const std::string refused = " is not a regular file with a single link, leaving it alone\\n\n",
+                    out = "failed to open outfile:" + kOutDir + "/RAMDUMP_OUTPUT for writing: ",
+                    not_held = std::string(kOther) + " does not hold " + kReserved + "\\n\n";
+  const std::vector<std::string> boot = {"-a"};
+  // clang-format off
+  const struct {
+    const char* what;
+    std::function<void(Fixture&)> plant;
+    std::vector<std::string> args;
+    int status;
+    std::string log;  // an error record of the tool's log, or "" for none
+  } rows[] = {
+    {"reserved file: link to a file on /data",
+     [](Fixture& f) { f.link("/data/victim", kReserved); }, boot, 255, kReserved + refused},
+    {"reserved file: link to a file on another file system",
+     [](Fixture& f) { f.link("/mnt/victim", kReserved); }, boot, 255, kReserved + refused},
+    {"reserved file: dangling link",
+     [](Fixture& f) { f.link("/data/absent", kReserved); }, boot, 255, kReserved + refused},
+    {"reserved file: a second name of another file", [](Fixture& f) {
+       f.d.remove(kReserved);
+       fs::create_hard_link(f.d.host_path("/data/victim"), f.d.host_path(kReserved));
+     }, boot, 255, kReserved + refused},
+    {"reserved file: FIFO", [](Fixture& f) { f.fifo(kReserved); }, boot, 255, kReserved + refused},
+    {"request file: dangling link",
+     [](Fixture& f) { f.link("/data/absent", kStatus); }, boot, 0, kStatus + refused},
+    {"request file: FIFO", [](Fixture& f) { f.fifo(kStatus); }, boot, 0, kStatus + refused},
+    {"apq: link to another directory",
+     [](Fixture& f) { f.link("/data/elsewhere", kDir + "apq"); }, boot, 255,
+     out + "Not a directory\\n\n"},
+    {"apq/00: link to another directory",
+     [](Fixture& f) { f.link("/data/elsewhere", kOutDir); }, boot, 255,
+     out + "Not a directory\\n\n"},
+    {"output file: link in place while the dump is read out",
+     [](Fixture& f) { f.pinned_link("RAMDUMP_OUTPUT"); }, boot, 255,
+     out + "Too many levels of symbolic links\\n\n"},
+    {"message file: link in place while the message is extracted",
+     [](Fixture& f) { f.pinned_link("RAMDUMP_MSG.txt", "RAMDUMP_OUTPUT"); }, boot, 0,
+     "Could not move " + kOutDir + "/RAMDUMP_MSG.txt into place: Operation not permitted\\n\n"},
+    // The mount table names the second file system's device: nothing is read, nor written into
+    // it, and the dump stays in the reserved blocks.
+    {"another device at boot", [](Fixture& f) { f.set_fstab(kOther); }, boot, 255, not_held},
+    {"another device, arming",
+     [](Fixture& f) { f.set_fstab(kOther); }, {"-i", "1", kReserved}, 255, not_held},
+    {"another device, integrity test",
+     [](Fixture& f) { f.set_fstab(kOther); }, {"-t", kReserved}, 255, not_held},
+    // A person's paths are taken as typed, but no open waits for a FIFO's other end.
+    {"FIFO: integrity test", [](Fixture& f) { f.fifo(kFifo); }, {"-t", kFifo}, 0,
+     "Failed to get block 0 for file " + kFifo + ": Inappropriate ioctl for device\\n\n"},
+    {"FIFO: read-out of it",
+     [](Fixture& f) { f.fifo(kFifo); }, {"-r", kFifo + ".out", kFifo}, 0, ""},
+    {"FIFO: read-out into it", [](Fixture& f) { f.fifo(kFifo); }, {"-r", kFifo, kReserved}, 255,
+     "failed to open outfile:" + kFifo + " for writing: No such device or address\\n\n"},
+    {"FIFO: creation", [](Fixture& f) { f.fifo(kFifo); }, {"-c", "65536", kFifo}, 255,
+     "failed to open file:" + kFifo + " for writing: No such device or address\\n\n"},
+  };
+  // clang-format on
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.what);
+    ASSERT_NO_FATAL_FAILURE(f.prepare());
+    const std::string before = f.untouchable(), dump = raw_at(f.d.data_device(), f.reserved);
+    row.plant(f);
+    const RunResult r = f.d.run(row.args, "reserveblocks", 20);
+    ASSERT_FALSE(r.timed_out);
+    EXPECT_EQ(r.status, row.status) << f.d.log();
+    EXPECT_TRUE(row.log.empty() ? !contains(tool_log(f.d), "E reserveblocks: ")
+                                : contains(tool_log(f.d), "E reserveblocks: " + row.log))
+        << f.d.log();
+    EXPECT_TRUE(f.untouchable() == before);
+    EXPECT_TRUE(fs::is_empty(f.d.host_path("/data/elsewhere")));
+    EXPECT_FALSE(f.d.exists("/data/absent"));
+    if (row.args == boot) {
+      EXPECT_EQ(f.d.property("debug.kvo.kvdump"), row.status == 0 ? "done" : "fail");
+    }
+    if (row.what == std::string("another device at boot")) {
+      EXPECT_TRUE(raw_at(f.d.data_device(), f.reserved) == dump);
+      EXPECT_FALSE(f.d.exists(kOutDir + "/RAMDUMP_OUTPUT"));
+    }
+  }
+
+  // As if /data were on a device-mapper device stacked on the second device alone: the chain
+  // goes into the second device, at the file's blocks.
+  ASSERT_NO_FATAL_FAILURE(f.prepare());
+  struct stat data;
+  ASSERT_EQ(stat(f.d.host_path(kReserved).c_str(), &data), 0);
+  fs::create_directories(f.d.host_path("/sys"));
+  ASSERT_EQ(mount("rbsys", f.d.host_path("/sys").c_str(), "tmpfs", 0, nullptr), 0);
+  const std::string sys = "/sys/dev/block/" + device_name(data.st_dev);
+  struct stat st;
+  ASSERT_EQ(stat(f.other.c_str(), &st), 0);
+  fs::create_directories(f.d.host_path(sys + "/dm"));
+  f.d.write_file(sys + "/slaves/loopx/dev", device_name(st.st_rdev) + "\n");
+  f.set_fstab(kOther);
+  EXPECT_EQ(f.d.run({"-i", "5eed", kReserved}).status, 0) << f.d.log();
+  EXPECT_EQ(walk_chain(f.other, make_ibh(f.reserved[0], 4096, kCount, 0x5eed, 1)), kCount);
+  f.d.write_file(sys + "/slaves/loopy/dev", device_name(st.st_rdev) + "\n");  // two slaves
+  EXPECT_EQ(f.d.run({"-t", kReserved}).status, 255);
+}
+
+// A run that finds another one working on the reserved file (played by the test holding the
+// ramdump directory's lock) touches nothing until that one is done, then acts on the state it
+// finds: a dump stored meanwhile is collected. Two real boot-time runs collide only when both
+// pass the presence test before either has created the file, which cannot be forced from here.
+TEST(HostilePaths, RunsOnTheReservedFileTakeTurns) {
+  Fixture f;
+  REQUIRE_DEVICE(f.d);
+  ASSERT_NO_FATAL_FAILURE(f.prepare());
+  // The stored header says "no dump" until the other run has stored one.
+  const std::string misc = f.d.misc_bytes(), waiting =
+                                                 "I reserveblocks: Waiting for another run "
+                                                 "on /data/vendor/ramdump\\n\n";
+  std::string no_dump = misc;
+  no_dump.replace(3184, 24, make_ibh(f.reserved[0], 4096, kCount, 0x5eed, 1));
+  write_host_file(f.d.misc_host_path(), no_dump);
+  auto held = [&](const std::vector<std::string>& args, const std::function<void()>& meanwhile) {
+    int dir = open(f.d.host_path(kDir).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    EXPECT_EQ(flock(dir, LOCK_EX), 0);
+    RunResult r;
+    std::thread run([&] { r = f.d.run(args, "reserveblocks", 30); });
+    for (int i = 0; i < 200 && !contains(f.d.log(), waiting); ++i) usleep(50000);
+    EXPECT_TRUE(contains(f.d.log(), waiting)) << f.d.log();
+    meanwhile();
+    close(dir);
+    run.join();
+    return r;
+  };
+  // Nothing of the boot-time run happens before it has the lock: not even the block address
+  // item, which it writes first.
+  RunResult r = held({"-a"}, [&] {
+    EXPECT_TRUE(f.d.misc_bytes() == no_dump);
+    write_host_file(f.d.misc_host_path(), misc);
+  });
+  EXPECT_EQ(r.status, 0) << f.d.log();
+  EXPECT_EQ(f.d.read_file(kOutDir + "/RAMDUMP_MSG.txt"), "watchdog timeout\n");
+  EXPECT_EQ(walk_chain(f.d.data_device(), stored_ibh(f.d)), kCount);
+  // A conversion on the reserved file takes turns too, also when -c is about to create it.
+  f.d.clear_log();
+  EXPECT_EQ(held({"-t", "-i", "5eed", kReserved}, [] {}).status, 0);
+  f.d.remove(kReserved);
+  f.d.clear_log();
+  EXPECT_EQ(held({"-c", "65536", kDir + "../ramdump/RAMDUMP_RESERVED"}, [] {}).status, 0);
+}
+
+// /data on a device-mapper linear target over the raw device, offset 0: the device holds the
+// file through the mapping, so arming goes on. Needs the kernel's device mapper.
+TEST(HostilePaths, DeviceMapperOverTheRawDevice) {
+  if (system("dmsetup version >/dev/null 2>&1") != 0) GTEST_SKIP() << "no device mapper here";
+  FakeDevice d(64ull << 20);
+  REQUIRE_DEVICE(d);
+  const std::string name = "rbtest-" + std::to_string(getpid()), data = d.host_path("/data");
+  int hold = open(d.data_device().c_str(), O_RDONLY | O_CLOEXEC);  // keeps the loop attached
+  ASSERT_EQ(umount(data.c_str()), 0);
+  ASSERT_NO_FATAL_FAILURE(shell("dmsetup create --noudevsync " + name +
+                                " --table \"0 $(blockdev --getsz " + d.data_device() + ") linear " +
+                                d.data_device() + " 0\" && dmsetup mknodes " + name));
+  close(hold);
+  const int mounted = mount(("/dev/mapper/" + name).c_str(), data.c_str(), "ext4", 0, nullptr);
+  fs::create_directories(d.host_path("/sys"));
+  const int sys = mount("sysfs", d.host_path("/sys").c_str(), "sysfs", MS_RDONLY, nullptr);
+  d.write_file(kDir + "mapped", std::string(kCount * 4096, '\xFF'));
+  const RunResult r = d.run({"-i", "5eed", kDir + "mapped"});
+  const std::string chain = verify_chain(d, map_file(d, kDir + "mapped", kCount), 0x5eed, true);
+  umount(data.c_str());
+  system(("dmsetup remove " + name).c_str());
+  ASSERT_EQ(mounted | sys, 0);
+  EXPECT_EQ(r.status, 0) << d.log();
+  EXPECT_EQ(chain, "");
+}
+
+}  // namespace
