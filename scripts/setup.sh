@@ -11,7 +11,7 @@ shift || true
 
 packages=(cmake g++ make pkg-config zlib1g-dev libgtest-dev googletest
   android-libbase-dev android-liblog-dev android-libcutils-dev
-  e2fsprogs util-linux mount)
+  e2fsprogs util-linux mount dmsetup)
 install_missing "${packages[@]}"
 
 cmake -S . -B "$build_dir" -DCMAKE_BUILD_TYPE=RelWithDebInfo "$@" >/dev/null
