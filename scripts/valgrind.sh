@@ -1,8 +1,11 @@
 #!/usr/bin/env bash
-# Runs the tool's main paths under valgrind's memcheck in the fake device root
-# (tests/fault/valgrind_paths.cpp): no invalid access, no leak but those listed in
-# tests/fault/valgrind.supp. Installs valgrind when missing and first builds the plain build
-# directory given (default: build). Run as root.
+# Runs the device tests of the tool's main paths with every program they start in the fake
+# device root under valgrind's memcheck (RB_TEST_WRAPPER): creation and arming, read-out and
+# integrity test, the boot entry and its request file, the read-out of a stored dump with its
+# message, and a mount table merged from the device tree and a file. An invalid access, or a
+# leak other than the memory the tool keeps on purpose (tests/fault/valgrind.supp), makes the
+# program exit with status 99, which fails its test. Installs valgrind when missing and first
+# builds the plain build directory given (default: build). Run as root.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 source scripts/install_missing.sh
@@ -13,6 +16,21 @@ if [ "$(id -u)" -ne 0 ]; then
 fi
 install_missing valgrind
 start=$SECONDS
-cmake --build "$build_dir" -j"$(nproc)" --target valgrind_paths >/dev/null
-"$build_dir/valgrind_paths"
-echo "valgrind: $((SECONDS - start)) s"
+cmake --build "$build_dir" -j"$(nproc)" \
+  --target block_io_test boot_cycle_test fstab_default_test >/dev/null
+# Inside the root, memcheck reads the suppressions from descriptor 4 and reports to descriptor
+# 3, both inherited from here.
+export RB_TEST_WRAPPER=/usr/bin/valgrind
+export VALGRIND_OPTS="-q --error-exitcode=99 --leak-check=full
+  --show-leak-kinds=definite,indirect,possible --errors-for-leak-kinds=definite,indirect,possible
+  --suppressions=/proc/self/fd/4 --log-fd=3"
+status=0
+{
+  "$build_dir/block_io_test" --gtest_brief=1 --gtest_filter='Arming.*' &&
+    "$build_dir/boot_cycle_test" --gtest_brief=1 \
+      --gtest_filter='BootEntry.*:AutoCycle.StateWordAndReadOutOfASmallChain' &&
+    "$build_dir/fstab_default_test" --gtest_brief=1 \
+      --gtest_filter='DefaultFstab.DeviceTreeTableMergedFirst'
+} 3>&2 4<tests/fault/valgrind.supp || status=1
+echo "valgrind: $((SECONDS - start)) s, $([ $status -eq 0 ] && echo "no errors" || echo FAILED)"
+exit "$status"

@@ -65,22 +65,22 @@ int attach_loop(const std::string& image, std::string* device) {
   return loop_fd;
 }
 
-}  // namespace
-
-// Under RB_TEST_WRAPPER (a qemu-user emulator inside the root) the program runs emulated; its
-// -0 keeps argv[0] as given, which the usage text shows.
+// Under RB_TEST_WRAPPER, a program inside the root (qemu-user for the aarch64 build, valgrind for
+// scripts/valgrind.sh), the program runs under it. qemu-user takes argv[0] from QEMU_ARGV0.
 void exec_program(const std::string& path, char** argv) {
   const char* wrapper = getenv("RB_TEST_WRAPPER");
   if (wrapper == nullptr || wrapper[0] == '\0') {
     execv(path.c_str(), argv);
     return;
   }
-  std::vector<char*> wrapped = {const_cast<char*>(wrapper), const_cast<char*>("-0"), argv[0],
-                                const_cast<char*>(path.c_str())};
+  setenv("QEMU_ARGV0", argv[0], 1);
+  std::vector<char*> wrapped = {const_cast<char*>(wrapper), const_cast<char*>(path.c_str())};
   for (char** arg = argv + 1; *arg != nullptr; ++arg) wrapped.push_back(*arg);
   wrapped.push_back(nullptr);
   execv(wrapper, wrapped.data());
 }
+
+}  // namespace
 
 bool fake_device_supported(std::string* why) {
   if (geteuid() == 0) return true;
@@ -226,7 +226,7 @@ RunResult FakeDevice::run(const std::vector<std::string>& args, const std::strin
         for (const std::string& arg : args) argv.push_back(const_cast<char*>(arg.c_str()));
         argv.push_back(nullptr);
         // The tool keeps some memory until it exits on purpose; its leaks are checked under
-        // valgrind (tests/fault/valgrind_paths.cpp) against a list of the intended ones.
+        // valgrind (scripts/valgrind.sh) against a list of the intended ones.
         setenv("ASAN_OPTIONS", "detect_leaks=0", 1);
         exec_program("/system/bin/" + program, argv.data());
         perror("execv");

@@ -75,8 +75,8 @@ class FakeDevice {
   std::string log() const { return read_file("/dev/__log__"); }
   void clear_log() { write_file("/dev/__log__", "", 0666); }
 
-  // Runs /system/bin/<program> chrooted into the root (argv[0] = program); a run longer than
-  // timeout_seconds is killed.
+  // Runs /system/bin/<program> chrooted into the root (argv[0] = program), under the program
+  // RB_TEST_WRAPPER names when that is set; a run longer than timeout_seconds is killed.
   RunResult run(const std::vector<std::string>& args, const std::string& program = "reserveblocks",
                 int timeout_seconds = 600);
   // Runs fn in a child chrooted into the root; its result is the exit status.
@@ -123,11 +123,6 @@ bool fake_device_supported(std::string* why);
 // Moves the process into a private mount namespace, so that the mounts of its fake devices
 // never reach the host and vanish with it. False, after perror(who), when that fails.
 bool enter_private_mount_namespace(const char* who);
-
-// Replaces the process with a program of the root (path inside it) as run() does: under the
-// emulator named by RB_TEST_WRAPPER when that is set (scripts/test-aarch64.sh). Returns only on
-// failure.
-void exec_program(const std::string& path, char** argv);
 
 // In a test: skips when the harness cannot run here, fails when the root was not set up.
 #define REQUIRE_DEVICE(device)                                              \
