@@ -1,10 +1,9 @@
 // ramdump_inspect extract: the records of the dump stream as files in a directory. Contents are
-// written straight from the read buffer, gathered into one writev per buffer and file, so a
-// record of any size takes no memory of its own.
+// written straight from the read buffer, one write per read and file, so a record of any size
+// takes no memory of its own.
 #include <errno.h>
 #include <fcntl.h>
 #include <inttypes.h>
-#include <limits.h>
 #include <stdio.h>
 #include <string.h>
 #include <sys/stat.h>
@@ -40,8 +39,6 @@ const char kUsage[] =
     "Exit status: 0 when every wanted record was written complete, 1 otherwise, 2 on a usage\n"
     "error.\n";
 
-static_assert(READ_UNITS <= IOV_MAX, "one writev takes a whole read");
-
 struct extract_state {
   const char* dir;
   int dir_fd;
@@ -51,8 +48,6 @@ struct extract_state {
   name_set names;  // record and file names met, with the flags below
   int fd;          // the current record's file, or -1 while records are skipped
   std::string file, note;
-  iovec pending[READ_UNITS];  // a record has at most one piece in each unit
-  size_t pending_count;
   bool failed;
   progress* prog;  // cleared before a line is printed
 };
@@ -127,12 +122,9 @@ int on_header(void* ctx, const dump_stream_record& r) {
   return 0;
 }
 
-int flush(void* ctx) {
+int on_content(void* ctx, const uint8_t* data, size_t length) {
   extract_state* st = static_cast<extract_state*>(ctx);
-  if (st->pending_count == 0) return 0;
-  const size_t count = st->pending_count;
-  st->pending_count = 0;
-  if (write_pieces(st->fd, st->pending, count) == 0) return 0;
+  if (st->fd < 0 || write_all(st->fd, data, length) == 0) return 0;
   fail(std::string(st->dir) + "/" + st->file, std::string("write failed: ") + strerror(errno));
   close(st->fd);
   st->fd = -1;
@@ -140,17 +132,9 @@ int flush(void* ctx) {
   return -1;
 }
 
-int on_content(void* ctx, const uint8_t* data, size_t length) {
-  extract_state* st = static_cast<extract_state*>(ctx);
-  if (st->fd < 0) return 0;
-  st->pending[st->pending_count++] = {const_cast<uint8_t*>(data), length};
-  return 0;
-}
-
 int on_record_end(void* ctx, const dump_stream_record& r, bool complete, uint64_t received) {
   extract_state* st = static_cast<extract_state*>(ctx);
   if (st->fd < 0) return 0;
-  if (flush(ctx) < 0) return -1;
   const std::string path = std::string(st->dir) + "/" + st->file;
   const int closed = close(st->fd);
   st->fd = -1;
@@ -220,7 +204,7 @@ int cmd_extract(int argc, char** argv) {
   dump_stream stream;
   dump_stream_init(&stream);
   const int rc =
-      readout_parse(&reader, &stream, {&st, on_header, on_content, on_record_end}, nullptr, flush);
+      readout_parse(&reader, &stream, {&st, on_header, on_content, on_record_end}, nullptr);
   if (st.fd >= 0) close(st.fd);  // a write failure ended the run
   close(st.dir_fd);
   fflush(stdout);

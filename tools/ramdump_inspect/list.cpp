@@ -109,7 +109,7 @@ int cmd_list(int argc, char** argv) {
   device_extraction device;
   device_extraction_init(&device);
   if (st.json) printf("{\"records\": [");
-  readout_parse(&reader, &stream, {&st, nullptr, nullptr, print_record}, &device, nullptr);
+  readout_parse(&reader, &stream, {&st, nullptr, nullptr, print_record}, &device);
 
   // The data ending early is the reason unless the stream had ended before it.
   std::string reason = dump_stream_end_token(stream), detail = dump_stream_end_text(stream);

@@ -56,7 +56,7 @@ int readout_open(readout_reader* r, const char* path, const char* what) {
   return 0;
 }
 
-size_t readout_next(readout_reader* r, const uint8_t** units) {
+size_t readout_next(readout_reader* r, uint8_t** units) {
   if (r->done) return 0;
   size_t have = 0;
   while (have < r->capacity) {
@@ -125,19 +125,28 @@ int readout_close(readout_reader* r) {
   return readout_damaged(*r) ? kExitBad : kExitOk;
 }
 
+size_t join_payloads(uint8_t* units, size_t count) {
+  for (size_t i = 0; i < count; ++i) {
+    memmove(units + i * UNIT_PAYLOAD_SIZE, units + i * UNIT_SIZE + CHAIN_BLOCK_HEADER_SIZE,
+            UNIT_PAYLOAD_SIZE);
+  }
+  return count * UNIT_PAYLOAD_SIZE;
+}
+
 int readout_parse(readout_reader* r, dump_stream* s, const dump_stream_sink& sink,
-                  device_extraction* device, int (*chunk_end)(void* ctx)) {
-  const uint8_t* units;
+                  device_extraction* device) {
+  uint8_t* units;
   for (size_t count; (count = readout_next(r, &units)) > 0;) {
-    for (size_t i = 0; i < count; ++i) {
-      const uint8_t* unit = units + i * UNIT_SIZE;
-      int rc = dump_stream_feed(s, unit + CHAIN_BLOCK_HEADER_SIZE, UNIT_PAYLOAD_SIZE, sink);
+    if (device == nullptr) {
+      int rc = dump_stream_feed(s, units, join_payloads(units, count), sink);
       if (rc < 0) return rc;
-      if (device != nullptr) device_extraction_feed(device, unit);
-    }
-    if (chunk_end != nullptr) {
-      int rc = chunk_end(sink.ctx);
-      if (rc < 0) return rc;
+    } else {
+      for (size_t i = 0; i < count; ++i) {
+        const uint8_t* unit = units + i * UNIT_SIZE;
+        int rc = dump_stream_feed(s, unit + CHAIN_BLOCK_HEADER_SIZE, UNIT_PAYLOAD_SIZE, sink);
+        if (rc < 0) return rc;
+        device_extraction_feed(device, unit);
+      }
     }
     // What follows the stream's end matters to neither.
     if (dump_stream_ended(*s) && (device == nullptr || device->stopped)) break;
@@ -145,25 +154,16 @@ int readout_parse(readout_reader* r, dump_stream* s, const dump_stream_sink& sin
   return dump_stream_finish(s, sink);
 }
 
-int write_pieces(int fd, iovec* pieces, size_t count) {
-  while (count > 0) {
-    ssize_t n = writev(fd, pieces, static_cast<int>(count));
+int write_all(int fd, const uint8_t* data, size_t length) {
+  while (length > 0) {
+    ssize_t n = write(fd, data, length);
     if (n < 0 && errno == EINTR) continue;
     if (n <= 0) {
       if (n == 0) errno = EIO;
       return -1;
     }
-    for (size_t done = static_cast<size_t>(n); done > 0;) {
-      if (done >= pieces->iov_len) {
-        done -= pieces->iov_len;
-        ++pieces;
-        --count;
-      } else {
-        pieces->iov_base = static_cast<uint8_t*>(pieces->iov_base) + done;
-        pieces->iov_len -= done;
-        done = 0;
-      }
-    }
+    data += n;
+    length -= static_cast<size_t>(n);
   }
   return 0;
 }

@@ -5,7 +5,6 @@
 
 #include <stddef.h>
 #include <stdint.h>
-#include <sys/uio.h>
 
 #include <string>
 
@@ -37,10 +36,10 @@ struct readout_reader {
 // `what` names the work in the progress line.
 int readout_open(readout_reader* r, const char* path, const char* what);
 
-// The next whole units with a good chain magic (at most READ_UNITS), at *units, valid until the
-// next call: their count, 0 once the data has ended (at its end, a bad chain magic or a read
-// error).
-size_t readout_next(readout_reader* r, const uint8_t** units);
+// The next whole units with a good chain magic (at most READ_UNITS), at *units, which the caller
+// may change, valid until the next call: their count, 0 once the data has ended (at its end, a
+// bad chain magic or a read error).
+size_t readout_next(readout_reader* r, uint8_t** units);
 
 // Whether the read-out had a problem: a partial last unit, a bad chain magic or a read error.
 inline bool readout_damaged(const readout_reader& r) {
@@ -55,13 +54,17 @@ std::string readout_stop_text(const readout_reader& r);
 // reader. Returns 1 when there was a problem, else 0.
 int readout_close(readout_reader* r);
 
-// The stream of a read-out run through a parser (and optionally the model of the tool's
-// extraction) until the data ends or both have ended; chunk_end, when given, is called before
-// the reader reuses the memory that the sink's content pieces point into. Returns 0, or the
-// sink's first negative result.
-int readout_parse(readout_reader* r, dump_stream* s, const dump_stream_sink& sink,
-                  device_extraction* device, int (*chunk_end)(void* ctx));
+// Moves the payloads of count units to the front of them, joined; returns their length.
+size_t join_payloads(uint8_t* units, size_t count);
 
-// Writes all of count pieces (at most IOV_MAX) with as few system calls as the kernel allows,
-// continuing after partial writes and interruptions; consumes the array. 0, or -1 with errno.
-int write_pieces(int fd, iovec* pieces, size_t count);
+// The stream of a read-out run through a parser until the data ends, or until the stream has
+// ended and so has the model of the tool's extraction when one is given. The model takes each
+// unit as read, and the parser then takes the unit's payload; without a model the payloads of
+// each read are joined first, so that a record's content in one read comes as one piece.
+// Returns 0, or the sink's first negative result.
+int readout_parse(readout_reader* r, dump_stream* s, const dump_stream_sink& sink,
+                  device_extraction* device);
+
+// Writes all of length bytes, continuing after partial writes and interruptions. 0, or -1 with
+// errno.
+int write_all(int fd, const uint8_t* data, size_t length);

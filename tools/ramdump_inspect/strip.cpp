@@ -1,4 +1,4 @@
-// ramdump_inspect strip: the payloads of a read-out joined, one gathered write per read.
+// ramdump_inspect strip: the payloads of a read-out joined in the read buffer, one write per read.
 #include <errno.h>
 #include <fcntl.h>
 #include <inttypes.h>
@@ -68,15 +68,10 @@ int cmd_strip(int argc, char** argv) {
     readout_close(&reader);
     return kExitBad;
   }
-  const uint8_t* units;
-  iovec payloads[READ_UNITS];
+  uint8_t* units;
   bool write_failed = false;
   for (size_t count; !write_failed && (count = readout_next(&reader, &units)) > 0;) {
-    for (size_t i = 0; i < count; ++i) {
-      payloads[i] = {const_cast<uint8_t*>(units + i * UNIT_SIZE + CHAIN_BLOCK_HEADER_SIZE),
-                     UNIT_PAYLOAD_SIZE};
-    }
-    if (write_pieces(fd, payloads, count) != 0) {
+    if (write_all(fd, units, join_payloads(units, count)) != 0) {
       write_failed = true;
       fail(file, std::string("write failed: ") + strerror(errno));
     }
