@@ -31,19 +31,23 @@ std::string patched(std::string image, size_t offset, const std::string& bytes) 
   return image.replace(offset, bytes.size(), bytes);
 }
 
-FakeDeviceConfig misc_config(uint8_t fill, bool primary, bool secondary) {
-  FakeDeviceConfig config;
-  config.misc_fill = fill;
-  config.misc_primary = primary;
-  config.misc_secondary = secondary;
-  return config;
+// A root whose misc partition images are filled with fill: the secondary one, and the primary
+// one when asked for; none when fill is negative.
+void set_misc(FakeDevice& device, int fill, bool primary = false) {
+  if (fill < 0) {
+    device.remove(MISC_DEVICE);
+    return;
+  }
+  write_host_file(device.misc_host_path(), std::string(1 << 20, static_cast<char>(fill)));
+  if (primary) device.write_file(kPrimary, device.misc_bytes());
 }
 
 // Each mode writes exactly its items; the misc image is filled with 0xA5 so that any other
 // byte written shows.
 TEST(SwitchModes, CommandLinesAndTheItemsEachModeWrites) {
-  FakeDevice device(misc_config(0xA5, false, true));
+  FakeDevice device;
   REQUIRE_DEVICE(device);
+  set_misc(device, 0xA5);
   const std::string blank = device.misc_bytes();
   for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
            {"-z"}, {"-c", "0"}, {"-c", "abc"}, {"-r"}, {"-i"}, {"-c"}, {"-sz"}}) {
@@ -80,7 +84,7 @@ TEST(SwitchModes, CommandLinesAndTheItemsEachModeWrites) {
 // are used only where they exist (the fake root has both). Without them the messages go to
 // standard error, a property cannot be set, and nothing is created in /dev.
 TEST(SwitchModes, HostWithoutLogFileOrPropertyDirectory) {
-  FakeDevice device(misc_config(0, false, true));
+  FakeDevice device;
   REQUIRE_DEVICE(device);
   write_host_file(device.misc_host_path(), patched(device.misc_bytes(), 3216, "DiSa"));
   device.remove("/dev/__log__");
@@ -104,8 +108,9 @@ TEST(SwitchModes, HostWithoutLogFileOrPropertyDirectory) {
 }
 
 TEST(MiscStore, MissingPartitionAndBadItems) {
-  FakeDevice device(misc_config(0, false, false));
+  FakeDevice device;
   REQUIRE_DEVICE(device);
+  set_misc(device, -1);
   struct {
     std::string option;
     int status;
@@ -160,13 +165,14 @@ TEST(MiscStore, MissingPartitionAndBadItems) {
 // The path is settled at the first access of a process: the primary one if it opens then (and
 // no fallback afterwards), else the secondary one for good.
 TEST(MiscStore, PathChoiceLastsForTheProcess) {
-  FakeDevice device(misc_config(0, true, true));
+  FakeDevice device;
   REQUIRE_DEVICE(device);
+  set_misc(device, 0, true);
   const std::string blank = device.misc_bytes();
   EXPECT_EQ(device.run({"-s"}).out, "Ramdump enabled\n");  // zeros are not "DiSa"
   EXPECT_EQ(device.run({"-d"}).status, 0);
-  EXPECT_EQ(device.misc_bytes(true), patched(blank, 3216, "DiSa"));
-  EXPECT_EQ(device.misc_bytes(false), blank);
+  EXPECT_EQ(device.read_file(kPrimary), patched(blank, 3216, "DiSa"));
+  EXPECT_EQ(device.misc_bytes(), blank);
 
   RunResult r = device.run_in_root([&] {
     uint8_t flag[4] = {'E', 'n', 'A', 'b'};
@@ -184,7 +190,7 @@ TEST(MiscStore, PathChoiceLastsForTheProcess) {
   });
   EXPECT_EQ(r.status, 0);
   EXPECT_EQ(r.out, "");
-  EXPECT_EQ(device.misc_bytes(false), patched(blank, 3216, "DiSa"));
+  EXPECT_EQ(device.misc_bytes(), patched(blank, 3216, "DiSa"));
 }
 
 }  // namespace

@@ -15,7 +15,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <chrono>
 #include <filesystem>
 #include <fstream>
@@ -28,15 +27,6 @@ namespace {
 
 void check(bool ok, const std::string& what) {
   if (!ok) throw std::runtime_error(what + ": " + strerror(errno));
-}
-
-// Live devices, torn down by a signal before the process dies of it.
-std::vector<FakeDevice*> live_devices;
-
-void teardown_on_signal(int sig) {
-  for (FakeDevice* device : live_devices) device->teardown();
-  signal(sig, SIG_DFL);
-  raise(sig);
 }
 
 // Attaches the image to a free loop device together with LO_FLAGS_AUTOCLEAR (LOOP_CONFIGURE), so
@@ -63,21 +53,6 @@ int attach_loop(const std::string& image, std::string* device) {
   if (image_fd >= 0) close(image_fd);
   if (control >= 0) close(control);
   return loop_fd;
-}
-
-// Under RB_TEST_WRAPPER, a program inside the root (qemu-user for the aarch64 build, valgrind for
-// scripts/valgrind.sh), the program runs under it. qemu-user takes argv[0] from QEMU_ARGV0.
-void exec_program(const std::string& path, char** argv) {
-  const char* wrapper = getenv("RB_TEST_WRAPPER");
-  if (wrapper == nullptr || wrapper[0] == '\0') {
-    execv(path.c_str(), argv);
-    return;
-  }
-  setenv("QEMU_ARGV0", argv[0], 1);
-  std::vector<char*> wrapped = {const_cast<char*>(wrapper), const_cast<char*>(path.c_str())};
-  for (char** arg = argv + 1; *arg != nullptr; ++arg) wrapped.push_back(*arg);
-  wrapped.push_back(nullptr);
-  execv(wrapper, wrapped.data());
 }
 
 }  // namespace
@@ -114,10 +89,6 @@ uint32_t le32_at(const std::string& b, size_t o) {
 }
 
 FakeDevice::FakeDevice(const FakeDeviceConfig& config) {
-  if (live_devices.empty()) {
-    for (int sig : {SIGINT, SIGTERM, SIGHUP, SIGPIPE}) signal(sig, teardown_on_signal);
-  }
-  live_devices.push_back(this);
   if (!fake_device_supported(&error_)) return;
   try {
     setup(config);
@@ -127,10 +98,7 @@ FakeDevice::FakeDevice(const FakeDeviceConfig& config) {
   }
 }
 
-FakeDevice::~FakeDevice() {
-  teardown();
-  live_devices.erase(std::find(live_devices.begin(), live_devices.end(), this));
-}
+FakeDevice::~FakeDevice() { teardown(); }
 
 void FakeDevice::setup(const FakeDeviceConfig& config) {
   char tmpl[] = "/tmp/rb-device.XXXXXX";
@@ -140,9 +108,8 @@ void FakeDevice::setup(const FakeDeviceConfig& config) {
   fs::create_directory(root_);
   check(mount("rbroot", root_.c_str(), "tmpfs", 0, "mode=0755") == 0, "mount tmpfs");
   root_mounted_ = true;
-  for (const char* dir :
-       {"/usr", "/proc", "/dev/__properties__", "/dev/block/bootdevice/by-name",
-        "/dev/block/platform/msm_sdcc.1/by-name", "/vendor/etc", "/system/bin", "/data", "/tmp"}) {
+  for (const char* dir : {"/usr", "/proc", "/dev/__properties__", "/dev/block/bootdevice/by-name",
+                          "/vendor/etc", "/system/bin", "/data", "/tmp"}) {
     fs::create_directories(host_path(dir));
   }
   const std::string usr = host_path("/usr"), proc = host_path("/proc");
@@ -159,9 +126,7 @@ void FakeDevice::setup(const FakeDeviceConfig& config) {
         "mount /proc with a fixture /proc/cmdline");
   check(mknod(host_path("/dev/null").c_str(), S_IFCHR | 0666, makedev(1, 3)) == 0, "/dev/null");
   clear_log();
-  const std::string misc(1 << 20, static_cast<char>(config.misc_fill));
-  if (config.misc_primary) write_host_file(misc_host_path(true), misc);
-  if (config.misc_secondary) write_host_file(misc_host_path(false), misc);
+  write_host_file(misc_host_path(), std::string(1 << 20, '\0'));
   for (const char* program : {"reserveblocks", "fstab_dump", "firmware_sim"}) {
     const std::string built = std::string(RB_BUILD_DIR) + "/" + program;
     if (fs::exists(built)) fs::copy_file(built, host_path("/system/bin/") + program);
@@ -222,13 +187,20 @@ RunResult FakeDevice::run(const std::vector<std::string>& args, const std::strin
                           int timeout_seconds) {
   return run_in_root(
       [&]() {
-        std::vector<char*> argv = {const_cast<char*>(program.c_str())};
-        for (const std::string& arg : args) argv.push_back(const_cast<char*>(arg.c_str()));
+        // Under a wrapper (qemu-user for the aarch64 build, valgrind) the program runs inside it;
+        // qemu-user takes argv[0] from QEMU_ARGV0.
+        const std::string path = "/system/bin/" + program;
+        const char* wrapper = getenv("RB_TEST_WRAPPER");
+        const bool wrapped = wrapper != nullptr && wrapper[0] != '\0';
+        std::vector<const char*> argv = {program.c_str()};
+        if (wrapped) argv = {wrapper, path.c_str()};
+        for (const std::string& arg : args) argv.push_back(arg.c_str());
         argv.push_back(nullptr);
+        setenv("QEMU_ARGV0", program.c_str(), 1);
         // The tool keeps some memory until it exits on purpose; its leaks are checked under
         // valgrind (scripts/valgrind.sh) against a list of the intended ones.
         setenv("ASAN_OPTIONS", "detect_leaks=0", 1);
-        exec_program("/system/bin/" + program, argv.data());
+        execv(wrapped ? wrapper : path.c_str(), const_cast<char**>(argv.data()));
         perror("execv");
         return 127;
       },

@@ -1,8 +1,8 @@
 // A throw-away Android-like root for running the real binaries at the fixed paths they use:
-// a tmpfs with /usr bound read-only, /proc with a fixture /proc/cmdline, the misc partition as
-// image files, the property directory, the programs in /system/bin, and optionally /data as ext4
-// on a self-detaching loop device. The process is in a private mount namespace
-// (device_test_main.cpp), so every mount vanishes with it even if it is killed.
+// a tmpfs with /usr bound read-only, /proc with a fixture /proc/cmdline, a zeroed 1 MiB misc
+// partition image at MISC_DEVICE, the property directory, the programs in /system/bin, and
+// optionally /data as ext4 on a self-detaching loop device. The process is in a private mount
+// namespace (device_test_main.cpp), so every mount vanishes with it even if it is killed.
 #pragma once
 
 #include <stdint.h>
@@ -29,9 +29,6 @@ inline bool contains(const std::string& text, const std::string& part) {
 struct FakeDeviceConfig {
   // Implicit, so that FakeDevice device(64u << 20) has a 64 MiB /data.
   FakeDeviceConfig(uint64_t data_bytes = 0) : data_bytes(data_bytes) {}
-  bool misc_primary = false;   // a 1 MiB image at /dev/block/platform/msm_sdcc.1/by-name/misc
-  bool misc_secondary = true;  // a 1 MiB image at /dev/block/bootdevice/by-name/misc
-  uint8_t misc_fill = 0;
   std::string cmdline = "console=ttyS0 androidboot.hardware=rbtest\n";
   uint64_t data_bytes;       // nonzero: /data is a (sparse) ext4 image of this size
   std::string mkfs_options;  // extra options for mkfs.ext4
@@ -86,12 +83,8 @@ class FakeDevice {
     stderr_listener_ = std::move(listener);
   }
 
-  std::string misc_host_path(bool primary = false) const {
-    return host_path(primary ? "/dev/block/platform/msm_sdcc.1/by-name/misc" : MISC_DEVICE);
-  }
-  std::string misc_bytes(bool primary = false) const {
-    return read_host_file(misc_host_path(primary));
-  }
+  std::string misc_host_path() const { return host_path(MISC_DEVICE); }
+  std::string misc_bytes() const { return read_file(MISC_DEVICE); }
 
   // The raw /data device (host node) and reads and writes through it.
   const std::string& data_device() const { return loop_device_; }
@@ -103,12 +96,9 @@ class FakeDevice {
   bool set_free_space(uint64_t bytes);
   uint64_t free_space() const;
 
-  // Unmounts everything and removes the work directory; also run by the destructor and on
-  // SIGINT, SIGTERM, SIGHUP and SIGPIPE.
-  void teardown();
-
  private:
   void setup(const FakeDeviceConfig& config);
+  void teardown();
 
   std::string work_;  // host temporary directory
   std::string root_;  // work_/root, a tmpfs
