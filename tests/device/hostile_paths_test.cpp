@@ -103,6 +103,10 @@ struct Fixture {
 
   // The feature enabled, the reserved file armed with a dump stored by the firmware.
   void prepare() {
+    if (d.exists("/data/vendor/real")) {
+      d.remove("/data/vendor/ramdump");
+      fs::rename(d.host_path("/data/vendor/real"), d.host_path(kDir));
+    }
     system(("chattr -i " + d.host_path(kOutDir) + " 2>/dev/null").c_str());
     for (const std::string& path : {kReserved, kStatus, kFifo, kFifo + ".out", kDir + "apq",
                                     std::string("/data/absent"), std::string("/data/elsewhere")}) {
@@ -115,9 +119,10 @@ struct Fixture {
     d.write_file(kReserved, std::string(kCount * 4096, '\xFF'), 0744);
     ASSERT_EQ(d.run({"-i", "5eed", kReserved}).status, 0) << d.log();
     reserved = map_file(d, kReserved, kCount);
-    write_host_file(
-        d.misc_host_path(),
-        d.misc_bytes().replace(3184, 24, make_ibh(reserved[0], 4096, kCount, 0x5eed, 1)));
+    write_host_file(d.misc_host_path(),
+                    d.misc_bytes()
+                        .replace(3184, 24, make_ibh(reserved[0], 4096, kCount, 0x5eed, 1))
+                        .replace(3216, 4, "EnAb"));
     d.write_file("/tmp/RAMDUMP_MSG.txt", "watchdog timeout\n");
     ASSERT_EQ(d.run({MISC_DEVICE, USERDATA_DEVICE, "/tmp/RAMDUMP_MSG.txt"}, "firmware_sim").status,
               0);
@@ -180,6 +185,11 @@ TEST(HostilePaths, NothingOutsideTheToolsFilesChanges) {
        fs::create_hard_link(f.d.host_path("/data/victim"), f.d.host_path(kReserved));
      }, boot, 255, kReserved + refused},
     {"reserved file: FIFO", [](Fixture& f) { f.fifo(kReserved); }, boot, 255, kReserved + refused},
+    // The directory itself is as good as missing: the feature is switched off.
+    {"ramdump directory: link to another directory", [](Fixture& f) {
+       fs::rename(f.d.host_path(kDir), f.d.host_path("/data/vendor/real"));
+       f.link("/data/elsewhere", "/data/vendor/ramdump");
+     }, boot, 255, "Could not statvfs /data/vendor/ramdump: Not a directory\\n\n"},
     {"request file: dangling link",
      [](Fixture& f) { f.link("/data/absent", kStatus); }, boot, 0, kStatus + refused},
     {"request file: FIFO", [](Fixture& f) { f.fifo(kStatus); }, boot, 0, kStatus + refused},
