@@ -12,7 +12,6 @@
 #include <sys/sysmacros.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <filesystem>
 #include <functional>
 #include <string>
@@ -46,27 +45,19 @@ std::string raw_at(const std::string& device, const std::vector<long>& blocks) {
 }
 
 // The chain as the firmware follows it from the stored initial block header: the number of
-// blocks whose magic and CRC are right, or -1 at the first that is not. The device is read 1 MiB
-// at a time: most links lead to the next block.
+// blocks whose magic and CRC are right, or -1 at the first that is not.
 long walk_chain(const std::string& device, const std::string& stored_header) {
   const initial_block_header ibh =
       decode_initial_block_header(reinterpret_cast<const uint8_t*>(stored_header.data()));
   int fd = open(device.c_str(), O_RDONLY | O_CLOEXEC);
-  std::string window;
-  uint32_t crc = ibh.initial_crc, start = 0;
+  uint32_t crc = ibh.initial_crc;
   long count = 0;
   for (uint32_t block = ibh.first_block; block != 0 && count >= 0 && count <= ibh.block_count;) {
-    if (window.empty() || block < start || block - start >= 256) {
-      start = block;
-      window.assign(256 * 4096, '\0');
-      window.resize(std::max(0l, pread(fd, &window[0], window.size(), start * 4096ll)));
-    }
-    const size_t at = (block - start) * 4096ull;
-    const auto* raw = reinterpret_cast<const uint8_t*>(window.data() + at);
+    uint8_t raw[CHAIN_BLOCK_HEADER_SIZE] = {};
+    pread(fd, raw, sizeof(raw), block * 4096ll);
     const chain_block_header h = decode_chain_block_header(raw);
     crc = chain_crc(crc, block, h.next_block);
-    count =
-        at + 16 <= window.size() && h.magic == CHAIN_BLOCK_MAGIC && h.crc == crc ? count + 1 : -1;
+    count = h.magic == CHAIN_BLOCK_MAGIC && h.crc == crc ? count + 1 : -1;
     block = h.next_block;
   }
   close(fd);
