@@ -2,16 +2,23 @@
 // reserveblocks binary, in a throw-away device root with a 16 GiB ext4 /data on a loop device:
 // enable, first boot (create and arm the reserved area), a crash stored by the simulated
 // firmware, second boot (read-out, message extraction, re-arming) and a third boot. Shows the
-// properties, the stored initial block header, the files and the log after every step.
+// properties, the stored initial block header, the files and the log after every step. Then
+// ramdump_inspect opens the collected dump as on an engineer's workstation, and a second crash
+// places the message record's header where the extraction at boot misses it and the inspector
+// does not. Exits 0 only when every extracted file equals what the firmware stored.
+#include <errno.h>
 #include <stdio.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <sstream>
 #include <string>
 #include <vector>
 
+#include "ramdump/chain_format.h"
 #include "tests/harness/chain_checks.h"
 #include "tests/harness/fake_device.h"
 
@@ -20,6 +27,10 @@ namespace {
 const char kReserved[] = "/data/vendor/ramdump/RAMDUMP_RESERVED";
 const char kOutput[] = "/data/vendor/ramdump/apq/00/RAMDUMP_OUTPUT";
 const char kMessage[] = "/data/vendor/ramdump/apq/00/RAMDUMP_MSG.txt";
+const char kMessageName[] = "RAMDUMP_MSG.txt";
+
+// The extraction at boot takes the read-out apart in 4096-byte units, whatever the block size.
+const size_t kUnitPayload = 4096 - CHAIN_BLOCK_HEADER_SIZE;
 
 double now_seconds() {
   struct timespec ts;
@@ -28,6 +39,11 @@ double now_seconds() {
 }
 
 void heading(const std::string& text) { printf("\n=== %s ===\n", text.c_str()); }
+
+void print_indented(const std::string& text, const char* indent = "  ") {
+  std::istringstream in(text);
+  for (std::string line; std::getline(in, line);) printf("%s%s\n", indent, line.c_str());
+}
 
 std::string state_words(uint32_t state) {
   std::string words;
@@ -59,7 +75,8 @@ void show_file(const FakeDevice& device, const char* path) {
   }
 }
 
-void show_state(FakeDevice& device) {
+// Shows the state after a run of the tool and hands back the run's log, which it clears.
+std::string show_state(FakeDevice& device) {
   std::string flag = device.misc_bytes().substr(3216, 4);
   printf("  misc enable flag: \"%s\"\n", flag.c_str());
   show_header(device);
@@ -68,14 +85,14 @@ void show_state(FakeDevice& device) {
          device.property("debug.kvo.ramdump_new_directory").c_str());
   for (const char* path : {kReserved, kOutput, kMessage}) show_file(device, path);
   printf("  log:\n");
-  std::istringstream log(tool_log(device));
-  std::string line;
-  while (std::getline(log, line)) printf("    %s\n", line.c_str());
+  std::string log = tool_log(device);
+  print_indented(log, "    ");
   device.clear_log();
+  return log;
 }
 
 bool run_step(FakeDevice& device, const std::string& title, const std::vector<std::string>& args,
-              const std::string& program = "reserveblocks") {
+              const std::string& program = "reserveblocks", std::string* log = nullptr) {
   heading(title);
   std::string shown = program;
   for (const std::string& arg : args) shown += " " + arg;
@@ -88,8 +105,219 @@ bool run_step(FakeDevice& device, const std::string& title, const std::vector<st
   if (program != "reserveblocks") printf("%s", r.err.c_str());
   printf("  exit status %d after %.1f s\n", r.status, now_seconds() - start);
   if (r.timed_out) return false;
-  if (program == "reserveblocks") show_state(device);
+  if (program == "reserveblocks") {
+    std::string shown_log = show_state(device);
+    if (log != nullptr) *log = shown_log;
+  }
   return true;
+}
+
+struct DumpFile {
+  std::string name;
+  std::string content;
+};
+
+// The firmware stores the files, given to it from the root's /tmp, after a filler record when
+// first_record_at is nonzero.
+bool store_dump(FakeDevice& device, const std::string& title, const std::vector<DumpFile>& files,
+                size_t first_record_at = 0) {
+  std::vector<std::string> args;
+  if (first_record_at != 0) args = {"--first-record-at", std::to_string(first_record_at)};
+  args.insert(args.end(), {MISC_DEVICE, USERDATA_DEVICE});
+  for (const DumpFile& file : files) {
+    device.write_file("/tmp/" + file.name, file.content);
+    args.push_back("/tmp/" + file.name);
+  }
+  if (!run_step(device, title, args, "firmware_sim")) return false;
+  show_header(device);
+  return true;
+}
+
+// Where the inspector runs: a directory on the host that stands for the engineer's workstation.
+// It sees the phone's files at their host paths, shown as $PHONE/..., as if pulled with adb.
+struct Workstation {
+  std::string dir;
+  std::string phone;  // the host path of the device root
+};
+
+std::string with_phone_shown(const Workstation& ws, std::string text) {
+  for (size_t at = 0; (at = text.find(ws.phone, at)) != std::string::npos;) {
+    text.replace(at, ws.phone.size(), "$PHONE");
+  }
+  return text;
+}
+
+// Runs the built ramdump_inspect in the workstation directory and shows its output, standard
+// output and error as they interleave; false when its exit status is not the expected one.
+bool inspect(const Workstation& ws, const std::vector<std::string>& args, int expected = 0,
+             std::string* output = nullptr) {
+  std::string shown = "ramdump_inspect";
+  for (const std::string& arg : args) shown += " " + with_phone_shown(ws, arg);
+  printf("\n$ %s\n", shown.c_str());
+  fflush(stdout);
+  int fds[2];
+  if (pipe(fds) != 0) {
+    perror("pipe");
+    return false;
+  }
+  const std::string program = std::string(RB_BUILD_DIR) + "/ramdump_inspect";
+  pid_t pid = fork();
+  if (pid == 0) {
+    dup2(fds[1], STDOUT_FILENO);
+    dup2(fds[1], STDERR_FILENO);
+    close(fds[0]);
+    close(fds[1]);
+    std::vector<char*> argv = {const_cast<char*>("ramdump_inspect")};
+    for (const std::string& arg : args) argv.push_back(const_cast<char*>(arg.c_str()));
+    argv.push_back(nullptr);
+    if (chdir(ws.dir.c_str()) == 0) execv(program.c_str(), argv.data());
+    perror(program.c_str());
+    _exit(127);
+  }
+  close(fds[1]);
+  std::string text;
+  char buf[4096];
+  for (ssize_t n; (n = read(fds[0], buf, sizeof(buf))) != 0;) {
+    if (n > 0) text.append(buf, static_cast<size_t>(n));
+    if (n < 0 && errno != EINTR) break;
+  }
+  close(fds[0]);
+  int wstatus = 0;
+  while (pid > 0 && waitpid(pid, &wstatus, 0) < 0 && errno == EINTR) {
+  }
+  const int status = pid > 0 && WIFEXITED(wstatus) ? WEXITSTATUS(wstatus) : -1;
+  print_indented(with_phone_shown(ws, text));
+  if (output != nullptr) *output = text;
+  if (status == expected) {
+    printf("  exit status %d\n", status);
+    return true;
+  }
+  printf("  exit status %d, expected %d\n", status, expected);
+  return false;
+}
+
+// One line per file: whether what the inspector extracted into dir equals what was stored.
+bool compare_extracted(const Workstation& ws, const std::string& dir, const DumpFile& file) {
+  const std::string path = dir + "/" + file.name;
+  const std::string extracted = read_host_file(ws.dir + "/" + path);
+  if (extracted == file.content) {
+    printf("  %s: identical to what the firmware stored (%zu bytes)\n", path.c_str(),
+           file.content.size());
+    return true;
+  }
+  printf("  %s: DIFFERS from what the firmware stored (%zu bytes, expected %zu)\n", path.c_str(),
+         extracted.size(), file.content.size());
+  return false;
+}
+
+// A crash's files: its message, and stand-ins for a kernel log and memory of the given sizes.
+std::vector<DumpFile> crash_files(const std::string& message, size_t log_bytes,
+                                  size_t memory_bytes) {
+  std::string memory(memory_bytes, '\0');
+  for (size_t i = 0; i < memory.size(); ++i) memory[i] = static_cast<char>(i * 31 + (i >> 10));
+  return {{"kernel_log.bin", std::string(log_bytes, 't')},
+          {kMessageName, message},
+          {"memory0.bin", memory}};
+}
+
+// The inspector on the first collection: the misc items, the read-out and the chain on the
+// device checked, the records listed and extracted.
+bool inspect_collection(const FakeDevice& device, const Workstation& ws,
+                        const std::vector<DumpFile>& stored) {
+  heading("On the workstation: ramdump_inspect opens the collected dump");
+  printf("  The engineer pulls RAMDUMP_OUTPUT and the misc partition with adb; here the\n");
+  printf("  inspector reads them where they lie, PHONE=%s\n", ws.phone.c_str());
+  const std::string misc = device.misc_host_path(), output = device.host_path(kOutput);
+  bool ok = inspect(ws, {"misc", misc});
+  ok = inspect(ws, {"verify", "--misc", misc, output}) && ok;
+  printf("  (the device's chain, read directly and read only: %s holds /data)\n",
+         device.data_device().c_str());
+  ok = inspect(ws, {"verify", "--device", device.data_device(), "--misc", misc}) && ok;
+  std::string listed;
+  ok = inspect(ws, {"list", output}, 0, &listed) && ok;
+  if (!contains(listed, "writes RAMDUMP_MSG.txt completely")) {
+    printf("  list does not say that the extraction at boot writes %s\n", kMessageName);
+    ok = false;
+  }
+  ok = inspect(ws, {"extract", output, "crash1"}) && ok;
+  for (const DumpFile& file : stored) ok = compare_extracted(ws, "crash1", file) && ok;
+  return ok;
+}
+
+// The stream offset for the first file that puts the message record's header gap bytes before
+// the end of a unit's payload, given the files stored ahead of the message.
+size_t first_record_offset(const std::vector<DumpFile>& files, size_t gap) {
+  size_t ahead = 0;
+  for (const DumpFile& file : files) {
+    if (file.name == kMessageName) break;
+    ahead += DUMP_FILE_RECORD_SIZE + file.content.size();
+  }
+  size_t at = (kUnitPayload - gap + kUnitPayload - ahead % kUnitPayload) % kUnitPayload;
+  return at < DUMP_FILE_RECORD_SIZE ? at + kUnitPayload : at;  // room for the filler record
+}
+
+// A second crash whose message record header straddles two units where the extraction at boot
+// reassembles it wrongly: the phone misses the message, the inspector recovers it.
+bool missed_message(FakeDevice& device, const Workstation& ws) {
+  heading("A second crash: the message record's header across a unit boundary");
+  const std::vector<DumpFile> files = crash_files(
+      "Unable to handle kernel NULL pointer dereference at virtual address 0000000000000008\n"
+      "Internal error: Oops: 96000005 [#1] PREEMPT SMP\n"
+      "CPU: 1 PID: 412 Comm: kworker/1:2 Tainted: G W\n"
+      "Call trace:\n  work_item_handler+0x3c/0x90\n  process_one_work+0x1d8/0x4a0\n"
+      "  worker_thread+0x54/0x410\n",
+      150000, 4 << 20);
+  const size_t gap = 28;  // the extraction at boot misses a header 17 to 39 bytes before the end
+  const size_t first = first_record_offset(files, gap);
+  const size_t header_at = first + DUMP_FILE_RECORD_SIZE + files[0].content.size();
+  printf("  Every 4096-byte unit of the read-out carries %zu bytes of the stream. With the\n",
+         kUnitPayload);
+  printf("  first file at stream offset %zu (after a filler record), %s's record\n", first,
+         files[0].name.c_str());
+  printf("  (%zu + %zu bytes) puts the message record's header at %zu = %zu x %zu + %zu:\n",
+         DUMP_FILE_RECORD_SIZE, files[0].content.size(), header_at, header_at / kUnitPayload,
+         kUnitPayload, header_at % kUnitPayload);
+  printf("  it starts %zu bytes before the end of a unit's payload.\n",
+         kUnitPayload - header_at % kUnitPayload);
+  if (!store_dump(device, "Firmware stores the second dump", files, first)) return false;
+
+  std::string log;
+  if (!run_step(device, "Next boot: read out, extract the message, re-arm", {"-a", "-p"},
+                "reserveblocks", &log)) {
+    return false;
+  }
+  const std::string& message = files[1].content;
+  bool ok = true;
+  if (!device.exists(kMessage)) {
+    printf("  %s: absent: the extraction at boot missed it\n", kMessageName);
+  } else if (device.read_file(kMessage) != message) {
+    printf("  %s: incomplete: the extraction at boot missed part of it\n", kMessageName);
+  } else {
+    printf("  %s: complete, which this placement was meant to prevent\n", kMessageName);
+    ok = false;
+  }
+  // The stream's clean end logs a bad magic too: what tells is that the message was not found.
+  const size_t bad = log.find("* bad magic");
+  if (bad != std::string::npos && !contains(log, "Found file 'RAMDUMP_MSG.txt'")) {
+    printf("  the log's \"%s\" is where it stopped\n",
+           log.substr(bad, log.find('\\', bad) - bad).c_str());
+  } else {
+    printf("  the log does not show the extraction stopping at the message record\n");
+    ok = false;
+  }
+
+  heading("On the workstation: the inspector recovers the message");
+  const std::string output = device.host_path(kOutput);
+  std::string listed;
+  ok = inspect(ws, {"list", output}, 0, &listed) && ok;
+  if (!contains(listed, "without RAMDUMP_MSG.txt")) {
+    printf("  list does not say that the extraction at boot misses %s\n", kMessageName);
+    ok = false;
+  }
+  ok = inspect(ws, {"extract", output, "crash2", kMessageName}) && ok;
+  ok = compare_extracted(ws, "crash2", files[1]) && ok;
+  print_indented(read_host_file(ws.dir + "/crash2/" + kMessageName), "    | ");
+  return ok;
 }
 
 }  // namespace
@@ -127,7 +355,7 @@ int main() {
     unsigned long done = 0, total = 0;
     if (sscanf(line.c_str(), "%lu/%lu", &done, &total) != 2 || total == 0) return;
     if (terminal) {
-      printf("\r  progress %-20s", line.c_str());
+      printf("\r  progress %-20s%s", line.c_str(), done == total ? "\n" : "");
       fflush(stdout);
       return;
     }
@@ -141,34 +369,21 @@ int main() {
                      "First boot: create and arm the reserved area ('fail' is expected: "
                      "there was no dump to collect)",
                      {"-a", "-p"});
-  printf("\n");
   if (!ok) return 1;
 
   heading("The phone crashes: the firmware follows the chain and stores a dump");
-  std::string message =
+  const std::vector<DumpFile> stored = crash_files(
       "Kernel panic - not syncing: Fatal exception in interrupt\n"
       "CPU: 3 PID: 0 Comm: swapper/3 Tainted: G W\n"
-      "Call trace:\n  watchdog_timer_fn+0x28/0x40\n  handle_irq+0x48/0x80\n";
-  device.write_file("/tmp/kernel_log.bin", std::string(200000, 't'));
-  device.write_file("/tmp/RAMDUMP_MSG.txt", message);
-  std::string memory(8 << 20, '\0');
-  for (size_t i = 0; i < memory.size(); ++i) memory[i] = static_cast<char>(i * 31 + (i >> 10));
-  device.write_file("/tmp/memory0.bin", memory);
-  if (!run_step(device, "Firmware stores three files",
-                {MISC_DEVICE, USERDATA_DEVICE, "/tmp/kernel_log.bin", "/tmp/RAMDUMP_MSG.txt",
-                 "/tmp/memory0.bin"},
-                "firmware_sim")) {
+      "Call trace:\n  watchdog_timer_fn+0x28/0x40\n  handle_irq+0x48/0x80\n",
+      200000, 8 << 20);
+  if (!store_dump(device, "Firmware stores three files", stored)) return 1;
+
+  if (!run_step(device, "Second boot: read out, extract the message, re-arm", {"-a", "-p"})) {
     return 1;
   }
-  show_header(device);
-
-  ok = run_step(device, "Second boot: read out, extract the message, re-arm", {"-a", "-p"});
-  printf("\n");
-  if (!ok) return 1;
   printf("  extracted %s:\n", kMessage);
-  std::istringstream extracted(device.read_file(kMessage));
-  std::string line;
-  while (std::getline(extracted, line)) printf("    | %s\n", line.c_str());
+  print_indented(device.read_file(kMessage), "    | ");
 
   if (!run_step(device, "Third boot: nothing new to collect", {"-a"})) return 1;
   char crc[16];
@@ -176,8 +391,22 @@ int main() {
   if (!run_step(device, "Integrity test of the re-armed chain", {"-t", "-i", crc, kReserved})) {
     return 1;
   }
+
+  // Beside the device root, in the device's work directory, which its teardown removes.
+  Workstation ws{
+      std::filesystem::path(device.host_path("")).parent_path().string() + "/workstation",
+      device.host_path("")};
+  std::filesystem::create_directory(ws.dir);
+  const bool first_ok = inspect_collection(device, ws, stored);
+  const bool second_ok = missed_message(device, ws);
+
   heading("Done");
   printf("  the whole cycle took %.0f s; the device root is now torn down\n",
          now_seconds() - start);
-  return 0;
+  if (first_ok && second_ok) {
+    printf("  every file the inspector extracted is identical to what the firmware stored\n");
+    return 0;
+  }
+  printf("  FAILED: see the lines above\n");
+  return 1;
 }
