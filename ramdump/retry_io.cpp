@@ -1,6 +1,7 @@
 #include "ramdump/retry_io.h"
 
 #include <android-base/file.h>
+#include <android-base/macros.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <string.h>
@@ -34,10 +35,7 @@ int write_retry(int fd, const void* buf, size_t length) {
 }
 
 off64_t seek_retry(int fd, off64_t offset) {
-  off64_t pos;
-  while ((pos = lseek64(fd, offset, SEEK_SET)) < 0 && errno == EINTR) {
-  }
-  return pos;
+  return TEMP_FAILURE_RETRY(lseek64(fd, offset, SEEK_SET));
 }
 
 void start_writeback(int fd, off64_t offset, off64_t length) {
