@@ -388,7 +388,8 @@ int main(int argc, char** argv) {
   }
   mknod(device.host_path("/dev/zero").c_str(), S_IFCHR | 0666, makedev(1, 5));
   std::filesystem::copy_file(std::string(RB_BUILD_DIR) + "/ramdump_inspect",
-                             device.host_path("/system/bin/ramdump_inspect"));
+                             device.host_path("/system/bin/ramdump_inspect"),
+                             std::filesystem::copy_options::overwrite_existing);
   const uint64_t count = size / kBlock;
   const std::string size_arg = std::to_string(size);
 
