@@ -4,6 +4,7 @@
 #include <android-base/unique_fd.h>
 #include <errno.h>
 #include <fcntl.h>
+#include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
@@ -45,29 +46,22 @@ uint64_t free_bytes_on_data() {
 
 std::string fd_path(int fd) { return android::base::StringPrintf("/proc/self/fd/%d", fd); }
 
-// The message file is extracted into a private directory and then moved into the output
-// directory, so that a link planted there during the read-out is replaced, never followed.
+// The read-out is read through the descriptor that passed the checks, and the message file is
+// written in place in apq/00 through its opened directory (the extraction neither follows a
+// link there nor waits for a FIFO).
 void extract_message(const file_ref& output) {
   android::base::unique_fd readout(open_file(output, O_RDONLY));
-  // What is not the read-out's own file is not read (the read-out has said why); a missing
-  // one is reported by the extraction.
-  if (readout < 0 && errno != ENOENT) return;
-  const std::string from = readout >= 0 ? fd_path(readout) : RAMDUMP_OUTPUT_PATH;
-  std::string stage = fd_path(ramdump_dir()) + "/." RAMDUMP_MSG_NAME ".XXXXXX";
-  const bool made = mkdtemp(&stage[0]) != nullptr;
-  android::base::unique_fd staged(made ? open_dir_at(AT_FDCWD, stage.c_str()) : -1);
-  // Without room for one more directory the message goes straight to the output directory.
-  const std::string to = staged >= 0          ? fd_path(staged)
-                         : output.dir_fd >= 0 ? fd_path(output.dir_fd)
-                                              : RAMDUMP_OUTPUT_DIR;
-  extract_ramdump_msg(from.c_str(), to.c_str());
-  struct stat st;
-  if (staged >= 0 && fstatat(staged, RAMDUMP_MSG_NAME, &st, AT_SYMLINK_NOFOLLOW) == 0 &&
-      renameat(staged, RAMDUMP_MSG_NAME, output.dir_fd, RAMDUMP_MSG_NAME) != 0) {
-    RB_LOGE("Could not move %s into place: %s\n", RAMDUMP_MSG_PATH, strerror(errno));
-    unlinkat(staged, RAMDUMP_MSG_NAME, 0);
+  if (readout < 0) {
+    const int error = errno;
+    fprintf(stderr, "Unable to open %s for reading\n", RAMDUMP_OUTPUT_PATH);
+    // A missing read-out is what the message above says; anything else is a refusal.
+    if (error != ENOENT) {
+      RB_LOGE("Not extracting %s from %s: %s\n", RAMDUMP_MSG_NAME, RAMDUMP_OUTPUT_PATH,
+              strerror(error));
+    }
+    return;
   }
-  if (made) unlinkat(ramdump_dir(), strrchr(stage.c_str(), '/') + 1, AT_REMOVEDIR);
+  extract_ramdump_msg(fd_path(readout).c_str(), fd_path(output.dir_fd).c_str());
 }
 
 // The stored header is marked armed without a dump before anything is read out, so that a

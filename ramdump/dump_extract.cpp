@@ -1,7 +1,10 @@
 #include "ramdump/dump_extract.h"
 
+#include <fcntl.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include "platform/log.h"
 #include "ramdump/chain_format.h"
@@ -61,6 +64,26 @@ void build_output_path(const char* out_dir, const char* name, char path[kOutputP
   }
 }
 
+// fopen(path, write ? "wb" : "rb") for a regular file only: the output directory may be open to
+// everyone, so the message file's name is never followed as a link and no open waits for a
+// FIFO. The read-out may be named by a descriptor's /proc link, which has to be followed; it
+// too must be a regular file. A file written through has no other name that would change.
+FILE* open_regular(const char* path, bool write) {
+  const int flags = write ? O_WRONLY | O_CREAT | O_NOFOLLOW : O_RDONLY;
+  int fd = open(path, flags | O_NONBLOCK | O_CLOEXEC | O_NOCTTY, 0666);
+  if (fd < 0) return nullptr;
+  struct stat st;
+  const int status = fcntl(fd, F_GETFL);
+  FILE* stream = nullptr;
+  if (fstat(fd, &st) == 0 && S_ISREG(st.st_mode) && (!write || st.st_nlink == 1) &&
+      (!write || ftruncate(fd, 0) == 0) && status >= 0 &&
+      fcntl(fd, F_SETFL, status & ~O_NONBLOCK) == 0) {
+    stream = fdopen(fd, write ? "wb" : "rb");
+  }
+  if (stream == nullptr) close(fd);
+  return stream;
+}
+
 }  // namespace
 
 int64_t process_data_filtered(const uint8_t* data, int64_t length, FILE** out,
@@ -109,7 +132,7 @@ int64_t process_data_filtered(const uint8_t* data, int64_t length, FILE** out,
     build_output_path(out_dir, name, st.path);
     if (is_wanted(st.header, wanted_name)) {
       RB_LOGI("Found file '%s', size %lu\n", name, static_cast<unsigned long>(st.header.size));
-      *out = fopen(st.path, "wb");
+      *out = open_regular(st.path, true);
       if (*out == nullptr) {
         fprintf(stderr, "Could not open file '%s' for writing\n", name);
         return -1;
@@ -122,7 +145,7 @@ int64_t process_data_filtered(const uint8_t* data, int64_t length, FILE** out,
 }
 
 int extract_ramdump_msg(const char* readout_path, const char* out_dir) {
-  FILE* in = fopen(readout_path, "rb");
+  FILE* in = open_regular(readout_path, false);
   if (in == nullptr) {
     fprintf(stderr, "Unable to open %s for reading\n", readout_path);
     return 0;
