@@ -99,7 +99,10 @@ bool is_enable_full(int argc, char** argv) {
 }
 
 int run_enable_full(uint32_t initial_crc) {
-  lock_ramdump_dir();
+  if (lock_ramdump_dir() != 0) {
+    publish_cycle_result(-1);
+    return 0;
+  }
   write_enable_flag(RAMDUMP_ENABLED);  // a failure is logged and the cycle runs anyway
   property_set(PROP_KVDUMP, "running");
   publish_cycle_result(process_auto_ramdump(initial_crc, 0));
@@ -107,7 +110,10 @@ int run_enable_full(uint32_t initial_crc) {
 }
 
 int run_auto_mode(const ramdump_options& options) {
-  lock_ramdump_dir();
+  if (lock_ramdump_dir() != 0) {
+    publish_cycle_result(-1);
+    return -1;
+  }
   uint8_t lba[4];
   put_le32(lba, RAMDUMP_LBA_DISABLED);
   if (MISC_write_RamdumpLBA(lba) != 0) {

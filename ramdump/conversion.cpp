@@ -21,7 +21,7 @@ int run_conversion(const ramdump_options& options, const char* program) {
   const char* path = options.block_file;
   if (path == nullptr) print_usage(program);
   // The reserved file is the boot-time run's: one run at a time works on it.
-  if (is_reserved_file(path)) lock_ramdump_dir();
+  if (is_reserved_file(path) && lock_ramdump_dir() != 0) return -1;
   if (options.create) {
     int rc =
         create_file(typed_path(path), static_cast<int64_t>(options.create_size), options.progress);

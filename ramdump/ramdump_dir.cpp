@@ -6,12 +6,16 @@
 #include <sys/file.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <string>
 
 #include "platform/log.h"
 #include "ramdump/ramdump_names.h"
 
 namespace {
+
+constexpr std::chrono::seconds kLockWait(120);
+constexpr useconds_t kLockPollMicroseconds = 50000;
 
 bool same_file(const struct stat& a, const struct stat& b) {
   return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
@@ -35,16 +39,28 @@ file_ref in_ramdump_dir(const char* name, const char* path) {
   return {path, name, dir, dir < 0 ? errno : 0};
 }
 
-void lock_ramdump_dir() {
+int lock_ramdump_dir() {
   const int dir = ramdump_dir();
-  if (dir < 0 || flock(dir, LOCK_EX | LOCK_NB) == 0) return;
-  int rc = -1;
-  if (errno == EWOULDBLOCK) {
-    RB_LOGI("Waiting for another run on %s\n", RAMDUMP_DIR);
-    while ((rc = flock(dir, LOCK_EX)) != 0 && errno == EINTR) {
+  if (dir < 0 || flock(dir, LOCK_EX | LOCK_NB) == 0) return 0;
+  if (errno != EWOULDBLOCK) {
+    RB_LOGE("Could not lock %s: %s\n", RAMDUMP_DIR, strerror(errno));
+    return -1;
+  }
+  RB_LOGI("Waiting for another run on %s\n", RAMDUMP_DIR);
+  // Anyone who can open the directory can hold a shared lock on it: the wait is bounded so
+  // that such a process cannot stall the boot-time run for ever.
+  const auto deadline = std::chrono::steady_clock::now() + kLockWait;
+  while (std::chrono::steady_clock::now() < deadline) {
+    usleep(kLockPollMicroseconds);
+    if (flock(dir, LOCK_EX | LOCK_NB) == 0) return 0;
+    if (errno != EWOULDBLOCK && errno != EINTR) {
+      RB_LOGE("Could not lock %s: %s\n", RAMDUMP_DIR, strerror(errno));
+      return -1;
     }
   }
-  if (rc != 0) RB_LOGE("Could not lock %s: %s\n", RAMDUMP_DIR, strerror(errno));
+  RB_LOGE("Gave up waiting for another run on %s after %lld seconds\n", RAMDUMP_DIR,
+          static_cast<long long>(kLockWait.count()));
+  return -1;
 }
 
 bool is_reserved_file(const char* path) {

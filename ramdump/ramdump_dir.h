@@ -13,9 +13,10 @@ int ramdump_dir();
 // A file of the directory, by its name and its path for messages.
 file_ref in_ramdump_dir(const char* name, const char* path);
 
-// Holds an exclusive lock on the directory until the process ends, waiting for another run
-// that holds it. Without the directory there is nothing to guard.
-void lock_ramdump_dir();
+// Takes an exclusive lock on the directory, held until the process ends, waiting up to two
+// minutes for another run that holds it. Returns 0, also without the directory (there is
+// nothing to guard then), or -1 after logging why the lock was not obtained.
+int lock_ramdump_dir();
 
 // Whether the block file as typed is the reserved file (or, before -c creates it, names it).
 bool is_reserved_file(const char* path);

@@ -6,6 +6,7 @@
 #include "platform/log.h"
 #include "ramdump/le_bytes.h"
 #include "ramdump/misc_flags.h"
+#include "ramdump/ramdump_dir.h"
 #include "ramdump/ramdump_names.h"
 
 bool print_ramdump_status() {
@@ -19,7 +20,10 @@ int ramdump_status_mode() {
   return 0;
 }
 
+// The boot-time run's lock: a switch in the middle of its cycle would leave the misc items
+// disagreeing with each other.
 int ramdump_enable_mode() {
+  if (lock_ramdump_dir() != 0) return 1;
   if (write_enable_flag(RAMDUMP_ENABLED) != 0) {
     RB_LOGE("failed to enable ramdump\n");
     return 1;
@@ -29,6 +33,7 @@ int ramdump_enable_mode() {
 }
 
 int ramdump_disable_mode() {
+  if (lock_ramdump_dir() != 0) return 1;
   if (write_disabled_ibh() != 0 || write_enable_flag(RAMDUMP_DISABLED) != 0) {
     RB_LOGE("failed to disable ramdump\n");
     return 1;
