@@ -35,12 +35,13 @@ int test_block_chain(const char* block_file, const char* blk_dev, uint32_t initi
     return -1;
   }
   RB_LOGI("Opened %s for reading\n", blk_dev);
-  if (check_device_holds_file(dev_fd, blk_dev, fd, block_file) != 0) return -1;
-  fd.reset();
   if (first == 0) {
     RB_LOGI("Read %d blocks successfully\n", 0);
     return 0;
   }
+  // Checked only now: without a first block nothing is read from the device.
+  if (check_device_holds_file(dev_fd, blk_dev, fd, block_file) != 0) return -1;
+  fd.reset();
 
   uint32_t block = static_cast<uint32_t>(first);
   uint32_t running_crc = initial_crc;

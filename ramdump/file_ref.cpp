@@ -22,7 +22,10 @@ int open_file(const file_ref& file, int flags, mode_t mode) {
   if (file.name == nullptr) return fail(-1, EFAULT);
   if (file.dir_fd == -1) return fail(-1, file.dir_error);
   const bool fixed = file.dir_fd != AT_FDCWD;
-  const int open_flags = (fixed ? (flags & ~O_TRUNC) | O_NOFOLLOW : flags) | O_NONBLOCK | O_CLOEXEC;
+  // The type is known only after the open: a terminal opened here must not become the
+  // process's controlling terminal.
+  const int open_flags =
+      (fixed ? (flags & ~O_TRUNC) | O_NOFOLLOW : flags) | O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
   int fd = openat(file.dir_fd, file.name, open_flags, mode);
   if (fd < 0) return -1;
   if (fixed) {

@@ -18,10 +18,10 @@ struct file_ref {
 
 inline file_ref typed_path(const char* path) { return {path, path}; }
 
-// open(2) of the file (O_CLOEXEC added). Inside a directory, a link fails with ELOOP, a directory
-// with EISDIR, a regular file with other links with EMLINK, anything else with ENXIO (what a
-// FIFO without a reader gives), and O_TRUNC applies only once the file has passed. Returns the
-// descriptor, or -1 with errno set.
+// open(2) of the file (O_CLOEXEC and O_NOCTTY added). Inside a directory, a link fails with ELOOP,
+// a directory with EISDIR, a regular file with other links with EMLINK, anything else with ENXIO
+// (what a FIFO without a reader gives), and O_TRUNC applies only once the file has passed. Returns
+// the descriptor, or -1 with errno set.
 int open_file(const file_ref& file, int flags, mode_t mode = 0);
 
 // stat(2) of the file; inside a directory, of the name itself rather than what a link names.
