@@ -163,7 +163,8 @@ TEST(HostilePaths, NothingOutsideTheToolsFilesChanges) {
     std::function<void(Fixture&)> plant;
     std::vector<std::string> args;
     int status;
-    std::string log;  // an error record of the tool's log, or "" for none
+    std::string log;  // an error record of the tool's log or a line on its standard error; "" for
+                      // no error record
   } rows[] = {
     {"reserved file: link to a file on /data",
      [](Fixture& f) { f.link("/data/victim", kReserved); }, boot, 255, kReserved + refused},
@@ -195,7 +196,7 @@ TEST(HostilePaths, NothingOutsideTheToolsFilesChanges) {
      out + "Too many levels of symbolic links\\n\n"},
     {"message file: link in place while the message is extracted",
      [](Fixture& f) { f.pinned_link("RAMDUMP_MSG.txt", "RAMDUMP_OUTPUT"); }, boot, 0,
-     "Could not move " + kOutDir + "/RAMDUMP_MSG.txt into place: Operation not permitted\\n\n"},
+     "Could not open file 'RAMDUMP_MSG.txt' for writing\n"},
     // The mount table names the second file system's device: nothing is read, nor written into
     // it, and the dump stays in the reserved blocks.
     {"another device at boot", [](Fixture& f) { f.set_fstab(kOther); }, boot, 255, not_held},
@@ -203,6 +204,15 @@ TEST(HostilePaths, NothingOutsideTheToolsFilesChanges) {
      [](Fixture& f) { f.set_fstab(kOther); }, {"-i", "1", kReserved}, 255, not_held},
     {"another device, integrity test",
      [](Fixture& f) { f.set_fstab(kOther); }, {"-t", kReserved}, 255, not_held},
+    // Without a block to read, the device is never touched: its check does not apply.
+    {"another device, integrity test without a first block", [](Fixture& f) {
+       f.set_fstab(kOther);
+       f.d.write_file(kFifo, "");
+     }, {"-t", kFifo}, 0, ""},
+    {"another device, read-out without a block", [](Fixture& f) {
+       f.set_fstab(kOther);
+       f.d.write_file(kFifo, "");
+     }, {"-r", kFifo + ".out", kFifo}, 0, ""},
     // A person's paths are taken as typed, but no open waits for a FIFO's other end.
     {"FIFO: integrity test", [](Fixture& f) { f.fifo(kFifo); }, {"-t", kFifo}, 0,
      "Failed to get block 0 for file " + kFifo + ": Inappropriate ioctl for device\\n\n"},
@@ -223,8 +233,16 @@ TEST(HostilePaths, NothingOutsideTheToolsFilesChanges) {
     ASSERT_FALSE(r.timed_out);
     EXPECT_EQ(r.status, row.status) << f.d.log();
     EXPECT_TRUE(row.log.empty() ? !contains(tool_log(f.d), "E reserveblocks: ")
-                                : contains(tool_log(f.d), "E reserveblocks: " + row.log))
-        << f.d.log();
+                                : contains(tool_log(f.d), "E reserveblocks: " + row.log) ||
+                                      contains(r.err, row.log))
+        << f.d.log() << r.err;
+    std::error_code none;  // the directory's link is absolute, into the device's root
+    for (const auto& entry : fs::directory_iterator(f.d.host_path(kDir), none)) {
+      const std::string name = entry.path().filename();
+      EXPECT_TRUE(name == "RAMDUMP_RESERVED" || name == "RAMDUMP_STATUS" || name == "apq" ||
+                  kDir + name == kFifo || kDir + name == kFifo + ".out")
+          << name;
+    }
     EXPECT_TRUE(f.untouchable() == before);
     EXPECT_TRUE(fs::is_empty(f.d.host_path("/data/elsewhere")));
     EXPECT_FALSE(f.d.exists("/data/absent"));
@@ -298,6 +316,20 @@ TEST(HostilePaths, RunsOnTheReservedFileTakeTurns) {
   f.d.remove(kReserved);
   f.d.clear_log();
   EXPECT_EQ(held({"-c", "65536", kDir + "../ramdump/RAMDUMP_RESERVED"}, [] {}).status, 0);
+  // A waiting run keeps the directory it opened. When no output can be made there (its apq is
+  // immutable), the message is not sought by name: a FIFO waits at that name meanwhile.
+  ASSERT_NO_FATAL_FAILURE(f.prepare());
+  const std::string real_apq = f.d.host_path("/data/vendor/real/apq");
+  r = held({"-a"}, [&] {
+    fs::rename(f.d.host_path(kDir), f.d.host_path("/data/vendor/real"));
+    fs::create_directories(f.d.host_path(kOutDir));
+    f.fifo(kOutDir + "/RAMDUMP_OUTPUT");
+    shell("mkdir -p " + real_apq + " && chattr +i " + real_apq);
+  });
+  shell("chattr -i " + real_apq);
+  EXPECT_FALSE(r.timed_out);
+  EXPECT_EQ(r.status, 255);
+  EXPECT_TRUE(contains(r.err, "Unable to open " + kOutDir + "/RAMDUMP_OUTPUT for reading\n"));
 }
 
 // /data on a device-mapper linear target over the raw device, offset 0: the device holds the
