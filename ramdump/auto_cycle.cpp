@@ -46,22 +46,15 @@ uint64_t free_bytes_on_data() {
 
 std::string fd_path(int fd) { return android::base::StringPrintf("/proc/self/fd/%d", fd); }
 
-// The read-out is read through the descriptor that passed the checks, and the message file is
+// The read-out is read through the descriptor it was written through, and the message file is
 // written in place in apq/00 through its opened directory (the extraction neither follows a
 // link there nor waits for a FIFO).
-void extract_message(const file_ref& output) {
-  android::base::unique_fd readout(open_file(output, O_RDONLY));
+void extract_message(int readout, int out_dir) {
   if (readout < 0) {
-    const int error = errno;
     fprintf(stderr, "Unable to open %s for reading\n", RAMDUMP_OUTPUT_PATH);
-    // A missing read-out is what the message above says; anything else is a refusal.
-    if (error != ENOENT) {
-      RB_LOGE("Not extracting %s from %s: %s\n", RAMDUMP_MSG_NAME, RAMDUMP_OUTPUT_PATH,
-              strerror(error));
-    }
     return;
   }
-  extract_ramdump_msg(fd_path(readout).c_str(), fd_path(output.dir_fd).c_str());
+  extract_ramdump_msg(fd_path(readout).c_str(), fd_path(out_dir).c_str());
 }
 
 // The stored header is marked armed without a dump before anything is read out, so that a
@@ -83,9 +76,11 @@ int read_out_and_rearm(const file_ref& reserved, const char* blk_dev, initial_bl
   const int out_dir = recreate_output_dir();
   const file_ref output{RAMDUMP_OUTPUT_PATH, RAMDUMP_OUTPUT_NAME, out_dir, out_dir < 0 ? errno : 0};
   android::base::unique_fd out_dir_holder(out_dir);
-  int result = raw_read_blocks(reserved, blk_dev, output);
+  int kept = -1;
+  int result = raw_read_blocks(reserved, blk_dev, output, &kept);
+  android::base::unique_fd readout(kept);
   if (result != 0) RB_LOGE("Failed to read out ramdump from reserved blocks\n");
-  extract_message(output);
+  extract_message(readout, out_dir);
   // Re-armed even after a failed read-out: the chain must be ready for the next crash.
   raw_write_blocks(reserved, blk_dev, ibh, ibh->initial_crc, static_cast<int>(progress));
   encode_initial_block_header(*ibh, raw);
@@ -162,18 +157,21 @@ int process_auto_ramdump(uint32_t initial_crc, uint32_t progress) {
     } else if (MISC_read_RamdumpIBH(raw) != 0) {
       RB_LOGE("Failed to read initial block header from MISC partition\n");
     } else {
+      // From here on the file is the one just opened and checked, whatever its name comes to
+      // name: its size, blocks and chain all belong to one inode.
+      file_ref held = reserved;
+      held.fd = fd;
       initial_block_header ibh = decode_initial_block_header(raw);
       if (newly_created) {
         // A first arming reports failure on purpose: there was no dump to collect.
-        if (raw_write_blocks(reserved, blk_dev, &ibh, initial_crc, static_cast<int>(progress)) ==
-            0) {
+        if (raw_write_blocks(held, blk_dev, &ibh, initial_crc, static_cast<int>(progress)) == 0) {
           encode_initial_block_header(ibh, raw);
           if (MISC_write_RamdumpIBH(raw) != 0) {
             RB_LOGE("Failed to write initial block header to MISC partition\n");
           }
         }
       } else {
-        result = read_out_and_rearm(reserved, blk_dev, &ibh, progress);
+        result = read_out_and_rearm(held, blk_dev, &ibh, progress);
       }
     }
     fd.reset();

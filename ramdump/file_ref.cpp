@@ -19,6 +19,7 @@ int fail(int fd, int error) {
 
 int open_file(const file_ref& file, int flags, mode_t mode) {
   // Without an operand on the command line the open fails as it would on a bad pointer.
+  if (file.fd >= 0) return fcntl(file.fd, F_DUPFD_CLOEXEC, 0);
   if (file.name == nullptr) return fail(-1, EFAULT);
   if (file.dir_fd == -1) return fail(-1, file.dir_error);
   const bool fixed = file.dir_fd != AT_FDCWD;
@@ -43,6 +44,7 @@ int open_file(const file_ref& file, int flags, mode_t mode) {
 }
 
 int stat_file(const file_ref& file, struct stat* st) {
+  if (file.fd >= 0) return fstat(file.fd, st);
   if (file.name == nullptr) return fail(-1, EFAULT);
   if (file.dir_fd == -1) return fail(-1, file.dir_error);
   return fstatat(file.dir_fd, file.name, st, file.dir_fd == AT_FDCWD ? 0 : AT_SYMLINK_NOFOLLOW);

@@ -14,6 +14,7 @@ struct file_ref {
   const char* name;       // relative to dir_fd
   int dir_fd = AT_FDCWD;  // AT_FDCWD: the path as typed; -1: the directory could not be opened
   int dir_error = 0;      // why, when dir_fd is -1
+  int fd = -1;            // once opened and verified: the file itself, which no rename replaces
 };
 
 inline file_ref typed_path(const char* path) { return {path, path}; }
@@ -22,9 +23,13 @@ inline file_ref typed_path(const char* path) { return {path, path}; }
 // a directory with EISDIR, a regular file with other links with EMLINK, anything else with ENXIO
 // (what a FIFO without a reader gives), and O_TRUNC applies only once the file has passed. Returns
 // the descriptor, or -1 with errno set.
+//
+// A file held by its descriptor is not looked up again: the open returns a duplicate of that
+// descriptor (opened for reading), whatever the flags.
 int open_file(const file_ref& file, int flags, mode_t mode = 0);
 
-// stat(2) of the file; inside a directory, of the name itself rather than what a link names.
+// stat(2) of the file; inside a directory, of the name itself rather than what a link names;
+// fstat(2) of a held file.
 int stat_file(const file_ref& file, struct stat* st);
 
 // Whether a boot-time file that exists may be used; if not, logs why and returns false.

@@ -56,7 +56,9 @@ int copy_run(int dev_fd, int out_fd, uint32_t first, uint32_t n, int64_t block_s
 
 }  // namespace
 
-int raw_read_blocks(const file_ref& block_file, const char* blk_dev, const file_ref& out_file) {
+int raw_read_blocks(const file_ref& block_file, const char* blk_dev, const file_ref& out_file,
+                    int* kept_out) {
+  if (kept_out != nullptr) *kept_out = -1;
   int64_t block_size;
   uint32_t count;
   int64_t size;
@@ -92,6 +94,7 @@ int raw_read_blocks(const file_ref& block_file, const char* blk_dev, const file_
     return -1;
   }
   RB_LOGI("Opened %s for writing\n", out_file.path);
+  if (kept_out != nullptr) *kept_out = fcntl(out_fd, F_DUPFD_CLOEXEC, 0);
 
   // Without room for a whole run the copy simply goes one block at a time.
   uint32_t run_blocks = block_size < kRunBytes ? static_cast<uint32_t>(kRunBytes / block_size) : 1;

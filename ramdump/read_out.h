@@ -8,5 +8,7 @@
 // Every block of block_file, mapped to its physical block, read from blk_dev and appended to
 // out_file (created with mode 0666), each block whole with its chain header. Returns 0, or -1
 // after logging the failure; a partly written out file stays. When blk_dev does not hold the
-// block file, nothing is read and no out file is made.
-int raw_read_blocks(const file_ref& block_file, const char* blk_dev, const file_ref& out_file);
+// block file, nothing is read and no out file is made. With kept_out, *kept_out is the out
+// file's descriptor once it was opened (the caller closes it), or -1.
+int raw_read_blocks(const file_ref& block_file, const char* blk_dev, const file_ref& out_file,
+                    int* kept_out = nullptr);
