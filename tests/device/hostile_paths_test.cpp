@@ -316,6 +316,9 @@ TEST(HostilePaths, RunsOnTheReservedFileTakeTurns) {
   f.d.remove(kReserved);
   f.d.clear_log();
   EXPECT_EQ(held({"-c", "65536", kDir + "../ramdump/RAMDUMP_RESERVED"}, [] {}).status, 0);
+  // So does a switch, which would otherwise leave the misc items disagreeing under a cycle.
+  f.d.clear_log();
+  EXPECT_EQ(held({"-d"}, [] {}).status, 0);
   // A waiting run keeps the directory it opened. When no output can be made there (its apq is
   // immutable), the message is not sought by name: a FIFO waits at that name meanwhile.
   ASSERT_NO_FATAL_FAILURE(f.prepare());
