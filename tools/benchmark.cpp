@@ -11,6 +11,7 @@
 // its data on the device. --size BYTES (a multiple of 4096) shrinks the reserved file for a
 // quick check of the benchmark itself.
 #include <fcntl.h>
+#include <malloc.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -61,6 +62,21 @@ struct Operation {
   std::vector<Sample> tool_runs, baseline_runs;
 };
 
+// Runs of physically consecutive blocks of the file in chain order: (first block, length).
+using Extents = std::vector<std::pair<long, long>>;
+
+Extents extents_of(const std::vector<long>& blocks) {
+  Extents extents;
+  for (long b : blocks) {
+    if (!extents.empty() && extents.back().first + extents.back().second == b) {
+      ++extents.back().second;
+    } else {
+      extents.push_back({b, 1});
+    }
+  }
+  return extents;
+}
+
 Operation operation(std::string name, std::function<RunResult()> tool,
                     std::function<RunResult()> baseline, uint64_t min_read, uint64_t min_written) {
   Operation op;
@@ -92,6 +108,11 @@ void device_counters(const FakeDevice& device, uint64_t* read, uint64_t* written
   *written = f[6] * 512;
 }
 
+void drop_caches() {
+  sync();
+  write_host_file("/proc/sys/vm/drop_caches", "3");
+}
+
 void sync_data(const FakeDevice& device) {
   int fd = open(device.host_path("/data").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   syncfs(fd);
@@ -102,8 +123,9 @@ void sync_data(const FakeDevice& device) {
 // come from the growth of RUSAGE_CHILDREN across its wait.
 Sample measure(FakeDevice& device, const std::string& what, const std::function<RunResult()>& run,
                int expected_status, RunResult* result) {
-  sync();
-  write_host_file("/proc/sys/vm/drop_caches", "3");
+  drop_caches();
+  // A child starts its peak RSS from what it shares with this process when it is forked.
+  malloc_trim(0);
   Sample s;
   uint64_t read0, written0;
   struct rusage before, after;
@@ -130,6 +152,22 @@ Sample measure(FakeDevice& device, const std::string& what, const std::function<
   return s;
 }
 
+// The file's extents, mapped with one FIBMAP a block as the tool maps it; the walk's wall and CPU
+// time from cold caches go to runs.
+Extents map_extents(FakeDevice& device, uint64_t count, std::vector<Sample>* runs) {
+  drop_caches();
+  struct rusage before, after;
+  getrusage(RUSAGE_SELF, &before);
+  const double start = now_seconds();
+  Extents extents = extents_of(map_file(device, kReserved, static_cast<uint32_t>(count)));
+  Sample s;
+  s.seconds = now_seconds() - start;
+  getrusage(RUSAGE_SELF, &after);
+  s.cpu = cpu_of(after.ru_utime, after.ru_stime) - cpu_of(before.ru_utime, before.ru_stime);
+  runs->push_back(s);
+  return extents;
+}
+
 // A program from the host's /usr, standard output to stdout_path (inside the root).
 RunResult run_host_program(FakeDevice& device, std::vector<std::string> argv,
                            const std::string& stdout_path = "") {
@@ -149,31 +187,28 @@ RunResult run_host_program(FakeDevice& device, std::vector<std::string> argv,
 }
 
 // The raw device I/O an operation amounts to, run in the root. Reading copies the chain blocks in
-// chain order (runs of consecutive blocks, at most 4 MiB a request) into copy_to when that is
-// given; writing then overwrites them with zeros. read_size below 4096 reads only that much of
-// each block, one request a block.
-RunResult raw_baseline(FakeDevice& device, const std::vector<long>& blocks, bool read,
-                       const std::string& copy_to, bool overwrite, size_t read_size) {
+// chain order, at most 4 MiB a request, into copy_to when that is given; writing then
+// overwrites them with zeros. one_block: a request for each block, as a walk of the chain makes.
+RunResult raw_baseline(FakeDevice& device, const Extents& extents, bool read,
+                       const std::string& copy_to, bool overwrite, bool one_block = false) {
   return device.run_in_root(
       [&] {
-        const size_t max_run = 1024;  // blocks, 4 MiB
-        std::vector<char> buf(max_run * kBlock, 0);
+        const long max_blocks = one_block ? 1 : 1024;
+        std::vector<char> buf(max_blocks * kBlock, 0);
         int dev = open(USERDATA_DEVICE, (overwrite ? O_RDWR : O_RDONLY) | O_CLOEXEC);
         int out = copy_to.empty() ? -1 : open(copy_to.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
         for (int pass = read ? 0 : 1; pass <= (overwrite ? 1 : 0); ++pass) {
-          for (size_t i = 0; i < blocks.size();) {
-            size_t n = 1;
-            while (read_size == 0 && i + n < blocks.size() && n < max_run &&
-                   blocks[i + n] == blocks[i] + static_cast<long>(n)) {
-              ++n;
+          for (const auto& extent : extents) {
+            for (long done = 0; done < extent.second;) {
+              const long n = std::min(extent.second - done, max_blocks);
+              const off_t at = static_cast<off_t>(extent.first + done) * kBlock;
+              const size_t bytes = static_cast<size_t>(n) * kBlock;
+              ssize_t got = pass == 0 ? pread(dev, buf.data(), bytes, at)
+                                      : pwrite(dev, buf.data(), bytes, at);
+              if (got != static_cast<ssize_t>(bytes)) return 1;
+              if (pass == 0 && out >= 0 && write(out, buf.data(), bytes) != got) return 1;
+              done += n;
             }
-            const off_t at = static_cast<off_t>(blocks[i]) * kBlock;
-            const size_t bytes = read_size != 0 ? read_size : n * kBlock;
-            ssize_t done =
-                pass == 0 ? pread(dev, buf.data(), bytes, at) : pwrite(dev, buf.data(), bytes, at);
-            if (done != static_cast<ssize_t>(bytes)) return 1;
-            if (pass == 0 && out >= 0 && write(out, buf.data(), bytes) != done) return 1;
-            i += n;
           }
           if (pass == 0 && out >= 0 && fsync(out) != 0) return 1;
           std::fill(buf.begin(), buf.end(), 0);
@@ -263,8 +298,19 @@ double median_of(const std::vector<Sample>& runs, uint64_t Sample::*field) {
 
 std::string mib(double bytes) { return fixed(bytes / kMiB, 1); }
 
-std::string report(const std::vector<Operation>& ops, uint64_t size, int runs, double minutes,
-                   const std::string& read_ahead_kb) {
+// What the report says besides the operations.
+struct Setting {
+  uint64_t size = 0;
+  int runs = 0;
+  double minutes = 0;
+  std::string read_ahead_kb;
+  std::vector<Sample> fibmap_runs;
+  long floor_kb = 0;  // the peak RSS of true, measured as the steps are
+};
+
+std::string report(const std::vector<Operation>& ops, const Setting& setting) {
+  const uint64_t size = setting.size;
+  const int runs = setting.runs;
   struct utsname uts;
   uname(&uts);
   time_t t = time(nullptr);
@@ -274,8 +320,9 @@ std::string report(const std::vector<Operation>& ops, uint64_t size, int runs, d
   r << "# Benchmark results\n\n"
     << "Written by `bash scripts/benchmark.sh --runs " << runs << "` on " << date << " ("
     << uts.sysname << " " << uts.release << ", " << sysconf(_SC_NPROCESSORS_ONLN)
-    << " CPUs, shared with other work), in " << fixed(minutes, 0) << " minutes. Reserved file "
-    << size << " bytes (" << size / kBlock << " blocks of 4096 bytes) on a 16 GiB ext4 file "
+    << " CPUs, shared with other work), in " << fixed(setting.minutes, 0)
+    << " minutes. Reserved file " << size << " bytes (" << size / kBlock
+    << " blocks of 4096 bytes) on a 16 GiB ext4 file "
     << "system on a loop device. Every step starts with the caches dropped and ends when a sync "
     << "of /data has put its data on the device; tool and baseline run one after the other, "
     << "taking turns going first where their order does not matter.\n\n"
@@ -335,12 +382,21 @@ std::string report(const std::vector<Operation>& ops, uint64_t size, int runs, d
        "contents; strip copies every payload up to the first unit that is not a chain block, "
        "which here is the whole read-out. Reads past a minimum are readahead: the loop device "
        "reads "
-    << read_ahead_kb
+    << setting.read_ahead_kb
     << " KiB ahead (twice that in a file read with POSIX_FADV_SEQUENTIAL), past the end of "
        "what a step needs and, on the raw device, across the gaps between the file's extents. "
        "System calls are no longer counted: strace -c slowed every traced run several times and "
        "took most of the benchmark's time, and the figures above do not vary with the load "
-       "either.\n\n## Goals missed\n\n";
+       "either.\n\n";
+  const std::vector<double> fw = values(setting.fibmap_runs, &Sample::seconds);
+  r << "The tool maps the file with one FIBMAP a block before it touches the chain (arming, "
+       "integrity test, read-out, second boot); the baselines are given the blocks. That walk "
+       "alone, from cold caches: "
+    << fixed(fw.front()) << " / " << fixed(median(fw)) << " / " << fixed(fw.back())
+    << " s (min / median / max), " << fixed(median(values(setting.fibmap_runs, &Sample::cpu)))
+    << " s CPU. A child's peak RSS starts from what it shares with the benchmark when it is "
+       "forked: a run of true measures "
+    << fixed(setting.floor_kb / 1024.0) << " MiB that way.\n\n## Goals missed\n\n";
   if (missed.empty()) r << "None.\n";
   for (const std::string& m : missed) r << "- " << m << "\n";
   r << "\n## Every run (seconds, in order)\n\n";
@@ -421,7 +477,8 @@ int main(int argc, char** argv) {
   // The units holding the stream, and the one whose magic ends it.
   const uint64_t stream_units = (stream + 4 + kPayload - 1) / kPayload * kBlock;
 
-  std::vector<long> blocks;  // the chain's blocks in chain order, for the baselines
+  Extents extents;  // the chain's blocks, for the baselines
+  std::vector<Sample> fibmap_runs;
   auto tool = [&device](std::vector<std::string> args) {
     return [&device, args] { return run_tool(device, args); };
   };
@@ -431,9 +488,9 @@ int main(int argc, char** argv) {
   auto cat_dump = [&device](std::string to) {
     return [&device, to] { return run_host_program(device, {"/usr/bin/cat", kDump}, to); };
   };
-  auto raw = [&](bool read, std::string copy_to, bool overwrite, size_t read_size) {
-    return [&, read, copy_to, overwrite, read_size] {
-      return raw_baseline(device, blocks, read, copy_to, overwrite, read_size);
+  auto raw = [&](bool read, std::string copy_to, bool overwrite, bool one_block = false) {
+    return [&, read, copy_to, overwrite, one_block] {
+      return raw_baseline(device, extents, read, copy_to, overwrite, one_block);
     };
   };
   const std::vector<std::string> dd = {
@@ -445,12 +502,12 @@ int main(int argc, char** argv) {
       operation(
           "creation", tool({"-c", size_arg, "-t", kReserved}),
           [&device, dd] { return run_host_program(device, dd); }, 0, size),
-      operation("arming", tool({"-i", "1", kReserved}), raw(false, "", true, 0), 0, size),
-      operation("integrity test", tool({"-t", "-i", "1", kReserved}), raw(true, "", false, kBlock),
+      operation("arming", tool({"-i", "1", kReserved}), raw(false, "", true), 0, size),
+      operation("integrity test", tool({"-t", "-i", "1", kReserved}), raw(true, "", false, true),
                 count * kBlock, 0),
-      operation("read-out", tool({"-r", kScratch, kReserved}), raw(true, kScratch, false, 0), size,
+      operation("read-out", tool({"-r", kScratch, kReserved}), raw(true, kScratch, false), size,
                 size),
-      operation("second boot", tool({"-a"}), raw(true, kScratch, true, 0), size, 2 * size),
+      operation("second boot", tool({"-a"}), raw(true, kScratch, true), size, 2 * size),
       operation("inspect verify", inspect({"verify", "--misc", kDumpMisc, kDump}),
                 cat_dump("/dev/null"), size, 0),
       operation("inspect list", inspect({"list", kDump}), cat_dump("/dev/null"), stream_units, 0),
@@ -487,7 +544,7 @@ int main(int argc, char** argv) {
         std::filesystem::remove_all(device.host_path(kScratch));
         std::filesystem::remove_all(device.host_path(kBootDir));
         if (tool && op.name == "creation") {
-          blocks = map_file(device, kReserved, static_cast<uint32_t>(count));
+          extents = map_extents(device, count, &fibmap_runs);
         }
         if (tool && op.name == "arming") armed = r;
       };
@@ -500,7 +557,15 @@ int main(int argc, char** argv) {
   const std::string loop = std::filesystem::path(device.data_device()).filename();
   std::string read_ahead = read_host_file("/sys/block/" + loop + "/queue/read_ahead_kb");
   read_ahead.erase(read_ahead.find_last_not_of("\n") + 1);
-  const std::string text = report(ops, size, runs, (now_seconds() - started) / 60, read_ahead);
+  Setting setting;
+  setting.size = size;
+  setting.runs = runs;
+  setting.minutes = (now_seconds() - started) / 60;
+  setting.read_ahead_kb = read_ahead;
+  setting.fibmap_runs = fibmap_runs;
+  malloc_trim(0);
+  setting.floor_kb = run_host_program(device, {"/usr/bin/true"}).max_rss_kb;
+  const std::string text = report(ops, setting);
   printf("\n%s", text.c_str());
   write_host_file(out_path, text);
   printf("\nwritten to %s\n", out_path.c_str());
