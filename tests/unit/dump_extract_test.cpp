@@ -103,7 +103,6 @@ TEST_F(DumpExtract, Endings) {
   const std::string empty_wanted = record("RAMDUMP_MSG.txt", "");
   const std::string filler = record("KLOG", pattern(kPayload - 80, 5));  // ends a payload
   const std::string tail = record("RAMDUMP_MSG.txt", "msg") + record("FW", pattern(kPayload, 9));
-  const std::string huge = dump_record("RAMDUMP_MSG.txt", 1ull << 40, "k") + tail;
   const std::string huger = dump_record("RAMDUMP_MSG.txt", ~0ull, "k") + tail;
   // The payloads after the first record header, which a record of a huge size takes.
   auto rest = [](const std::string& readout) {
@@ -119,8 +118,6 @@ TEST_F(DumpExtract, Endings) {
   } cases[] = {
       // A zero-length item is never reported as written, so a wanted record of size 0 fails as
       // soon as any data follows it, in the same payload or the next unit.
-      {"empty wanted record, zeros after it", readout_units(record("KLOG", "k") + empty_wanted),
-       "Could not write 0 bytes", "", found + "0\n"},
       {"empty wanted record, data in the next unit", readout_units(filler + empty_wanted + tail),
        "Could not write 0 bytes", "", found + "0\n"},
       {"empty wanted record, nothing after it", readout_units(filler + empty_wanted), "", "",
@@ -131,11 +128,9 @@ TEST_F(DumpExtract, Endings) {
       {"partial last unit: never looked at", two_units.substr(0, kUnit + 1000), "",
        msg.substr(0, kPayload - 40), found + "6000\n"},
       // Sizes beyond the data: a record that is not wanted swallows everything after it, a wanted
-      // one takes it all, also with a size past the signed range.
+      // one takes it all, even with a size past the signed range.
       {"huge record before the wanted one",
        readout_units(dump_record("KLOG", 1ull << 40, "k") + tail), "", "(none)", ""},
-      {"huge wanted record", readout_units(huge), "", rest(readout_units(huge)),
-       found + "1099511627776\n"},
       {"wanted record past the signed range", readout_units(huger), "", rest(readout_units(huger)),
        found + "18446744073709551615\n"},
   };
