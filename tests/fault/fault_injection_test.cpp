@@ -189,6 +189,15 @@ std::vector<Case> cases() {
                                            "/dev/__properties__/debug.kvo.ramdump_new_directory",
                                            kOutput, kMessage};
   auto loop = [](Context& c) { relink(c.device, c.reserved, 5, c.reserved[2]); };
+  auto cut_dev = [](Context& c) {  // a device-tree mount table whose dev value lacks its NUL
+    const std::string nul(1, '\0');
+    c.device.write_file("/dt/compatible", "android,firmware" + nul);
+    c.device.write_file("/dt/fstab/compatible", "android,fstab" + nul);
+    c.device.write_file("/dt/fstab/data/dev", USERDATA_DEVICE);
+    c.device.write_file("/dt/fstab/data/type", "ext4" + nul);
+    c.device.write_file("/dt/fstab/data/mnt_flags", "noatime" + nul);
+    c.device.write_file("/dt/fstab/data/fsmgr_flags", "wait" + nul);
+  };
   // clang-format off
   return {
     {"EINTR on reads and seeks of the device: read-out unchanged", eintr_reads,
@@ -237,16 +246,10 @@ std::vector<Case> cases() {
      "firmware_sim"},
     {"device-tree dev value without its NUL: the cut name is no device", "", {kArmed}, 255, "",
      {I("  block dev: /dev/block/bootdevice/by-name/userdat"),
-      E("failed to open blk_dev for writing: No such file or directory")}, {}, nullptr,
-     [](Context& c) {
-       const std::string nul(1, '\0');
-       c.device.write_file("/dt/compatible", "android,firmware" + nul);
-       c.device.write_file("/dt/fstab/compatible", "android,fstab" + nul);
-       c.device.write_file("/dt/fstab/data/dev", USERDATA_DEVICE);
-       c.device.write_file("/dt/fstab/data/type", "ext4" + nul);
-       c.device.write_file("/dt/fstab/data/mnt_flags", "noatime" + nul);
-       c.device.write_file("/dt/fstab/data/fsmgr_flags", "wait" + nul);
-     }},
+      E("failed to open blk_dev for writing: No such file or directory")}, {}, nullptr, cut_dev},
+    {"the same for a read-out: nothing created", "", {"-r", kOut, kArmed}, 255, std::nullopt,
+     {E("failed to open blk_dev:/dev/block/bootdevice/by-name/userdat for reading: No such file "
+        "or directory")}, {}, nullptr, cut_dev},
     {"ENOSPC while creating the reserved file at boot", "write.data=ENOSPC#2", {"-a"}, 255, "",
      {I("Creating reserved area 4429185024 bytes"), E("error writing: No space left on device")},
      {MISC_DEVICE, kKvdump, kReserved}, nullptr,
