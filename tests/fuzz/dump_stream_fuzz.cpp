@@ -8,7 +8,6 @@
 // Whatever the record names say, nothing but the message file may appear, and only in the
 // output directory.
 #include <stdlib.h>
-#include <sys/mman.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -52,24 +51,17 @@ void extract(const uint8_t* data, size_t size, bool pad_last) {
     readout.append(reinterpret_cast<const char*>(data + at), n);
     if (pad_last) readout.append(kPayload - n, '\0');
   }
-  const int fd = memfd_create("readout", MFD_CLOEXEC);
-  if (write(fd, readout.data(), readout.size()) != static_cast<ssize_t>(readout.size())) abort();
-  extract_ramdump_msg(("/proc/self/fd/" + std::to_string(fd)).c_str(), out_dir.c_str());
-  close(fd);
+  fuzz_extract(readout, out_dir);
 }
 
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
-  fuzz_quiet_logging();
-  char tmpl[] = "/tmp/rb-dump-fuzz.XXXXXX";
-  if (mkdtemp(tmpl) == nullptr) abort();
-  base_dir = tmpl;
+  base_dir = fuzz_scratch_dir();
   out_dir = base_dir + "/out";
   message = out_dir + "/" + kWanted;
   if (mkdir(out_dir.c_str(), 0755) != 0) abort();
-  atexit([] { std::filesystem::remove_all(base_dir); });
-  return 0;
+  return fuzz_quiet_logging();
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {

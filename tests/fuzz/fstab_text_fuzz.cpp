@@ -8,10 +8,7 @@
 #include "fs_mgr/fs_mgr_fstab.h"
 #include "tests/fuzz/fuzz_common.h"
 
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-  fuzz_quiet_logging();
-  return 0;
-}
+extern "C" int LLVMFuzzerInitialize(int*, char***) { return fuzz_quiet_logging(); }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (size == 0 || has_intended_size_overflow(data, size)) return 0;

@@ -1,5 +1,5 @@
-// Shared by the fuzz targets: quiet logging, and the option values that end the process on
-// purpose.
+// Shared by the fuzz targets: quiet logging, a scratch directory, the extraction from a read-out
+// in memory, and the option values that end the process on purpose.
 #pragma once
 
 #include <android-base/logging.h>
@@ -7,14 +7,36 @@
 #include <stdint.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/mman.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <string>
 
-// Messages are still formatted (INFO is the tool's minimum severity) but go nowhere.
-inline void fuzz_quiet_logging() {
+#include "ramdump/dump_extract.h"
+
+// Messages are still formatted (INFO is the tool's minimum severity) but go nowhere. Returns 0,
+// what LLVMFuzzerInitialize returns.
+inline int fuzz_quiet_logging() {
   __android_log_set_logger([](const struct __android_logger_data*, const char*) {});
   android::base::SetMinimumLogSeverity(android::base::INFO);
+  return 0;
+}
+
+// A new directory under /tmp, removed when the process ends (one per process).
+inline std::string fuzz_scratch_dir() {
+  static char dir[] = "/tmp/rb-fuzz.XXXXXX";
+  if (mkdtemp(dir) == nullptr) abort();
+  atexit([] { std::filesystem::remove_all(dir); });
+  return dir;
+}
+
+// The tool's message extraction from a read-out held in memory, into dir.
+inline void fuzz_extract(const std::string& readout, const std::string& dir) {
+  const int fd = memfd_create("readout", MFD_CLOEXEC);
+  if (write(fd, readout.data(), readout.size()) != static_cast<ssize_t>(readout.size())) abort();
+  extract_ramdump_msg(("/proc/self/fd/" + std::to_string(fd)).c_str(), dir.c_str());
+  close(fd);
 }
 
 // Whether the bytes may hold a "reservedsize=" or "zramsize=" value whose size overflows 64

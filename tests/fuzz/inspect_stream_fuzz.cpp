@@ -5,12 +5,10 @@
 // records. Cut into units, the model must say RAMDUMP_MSG.txt comes out complete exactly when
 // the real extraction writes a file of the size its last "Found file" line announced.
 #include <stdlib.h>
-#include <sys/mman.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <filesystem>
 #include <string>
 
 #include "ramdump/dump_extract.h"
@@ -70,11 +68,8 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
   __android_log_set_logger([](const struct __android_logger_data*, const char* text) {
     found |= sscanf(text, "Found file '%*[^']', size %llu", &found_size) == 1;
   });
-  char tmpl[] = "/tmp/rb-inspect-fuzz.XXXXXX";
-  if (mkdtemp(tmpl) == nullptr) abort();
-  base_dir = tmpl;
+  base_dir = fuzz_scratch_dir();
   message = base_dir + "/RAMDUMP_MSG.txt";
-  atexit([] { std::filesystem::remove_all(base_dir); });
   return 0;
 }
 
@@ -94,12 +89,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
       device_extraction_feed(&device, reinterpret_cast<const uint8_t*>(unit.data()));
     readout += unit;
   }
-  const int fd = memfd_create("readout", MFD_CLOEXEC);
-  if (write(fd, readout.data(), readout.size()) != static_cast<ssize_t>(readout.size())) abort();
   reset_dump_filter_state_for_test();
   found = false;
-  extract_ramdump_msg(("/proc/self/fd/" + std::to_string(fd)).c_str(), base_dir.c_str());
-  close(fd);
+  fuzz_extract(readout, base_dir);
   struct stat st;
   const bool real = found && stat(message.c_str(), &st) == 0 &&
                     static_cast<unsigned long long>(st.st_size) == found_size;
