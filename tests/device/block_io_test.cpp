@@ -24,13 +24,6 @@ size_t longest_run(const std::vector<long>& blocks) {
   return longest;
 }
 
-// The blocks' bytes on the raw device, in the order given.
-std::string raw_blocks(const FakeDevice& device, const std::vector<long>& blocks) {
-  std::string bytes;
-  for (long block : blocks) bytes += device.read_raw(static_cast<uint64_t>(block) * 4096, 4096);
-  return bytes;
-}
-
 // What a conversion prints: the device, then the header fields, block size before first block.
 std::string header_lines(uint32_t first, uint32_t count, uint32_t crc) {
   char text[160];

@@ -24,11 +24,6 @@ const char kNoDump[] = "E reserveblocks: No ramdump found, exiting\\n\n";
 const uint64_t kGiB = 1ull << 30;
 using Files = std::vector<std::pair<std::string, std::string>>;
 
-void set_misc_item(FakeDevice& device, size_t offset, const std::string& bytes) {
-  write_host_file(device.misc_host_path(),
-                  device.misc_bytes().replace(offset, bytes.size(), bytes));
-}
-
 mode_t mode_of(const FakeDevice& device, const std::string& path) {
   struct stat st;
   return stat(device.host_path(path).c_str(), &st) == 0 ? st.st_mode & 07777 : 0;

@@ -69,6 +69,17 @@ std::string verify_chain(const FakeDevice& device, const std::vector<long>& bloc
   return problem;
 }
 
+std::string raw_blocks(const FakeDevice& device, const std::vector<long>& blocks) {
+  std::string bytes;
+  for (long block : blocks) bytes += device.read_raw(static_cast<uint64_t>(block) * 4096, 4096);
+  return bytes;
+}
+
+void set_misc_item(FakeDevice& device, size_t offset, const std::string& bytes) {
+  write_host_file(device.misc_host_path(),
+                  device.misc_bytes().replace(offset, bytes.size(), bytes));
+}
+
 std::string tool_log(const FakeDevice& device) {
   std::istringstream in(device.log());
   std::string kept;

@@ -19,6 +19,11 @@ std::vector<long> map_file(const FakeDevice& device, const std::string& path, ui
 std::string verify_chain(const FakeDevice& device, const std::vector<long>& blocks,
                          uint32_t initial_crc, bool payload_zero);
 
+// The blocks' bytes on the raw device, in the order given.
+std::string raw_blocks(const FakeDevice& device, const std::vector<long>& blocks);
+// Replaces bytes of the misc image at offset.
+void set_misc_item(FakeDevice& device, size_t offset, const std::string& bytes);
+
 // The tool's own log records, without the mount table reader's "[libfs_mgr]" lines.
 std::string tool_log(const FakeDevice& device);
 
