@@ -1,9 +1,11 @@
 #include "tools/ramdump_inspect/cli.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/stat.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -22,6 +24,19 @@ int usage_error(const char* usage, const std::string& message) {
 int fail(const std::string& file, const std::string& problem) {
   fprintf(stderr, "ramdump_inspect: %s: %s\n", file.c_str(), problem.c_str());
   return kExitBad;
+}
+
+int open_input(const char* path, struct stat* st) {
+  int fd = open(path, O_RDONLY | O_NONBLOCK | O_CLOEXEC | O_NOCTTY);
+  if (fd < 0) return -1;
+  const int flags = fcntl(fd, F_GETFL);
+  if (fstat(fd, st) != 0 || flags < 0 || fcntl(fd, F_SETFL, flags & ~O_NONBLOCK) != 0) {
+    const int error = errno;
+    close(fd);
+    errno = error;
+    return -1;
+  }
+  return fd;
 }
 
 bool parse_u32(const char* text, bool hex, uint32_t* out) {

@@ -6,6 +6,8 @@
 
 #include <string>
 
+struct stat;
+
 constexpr int kExitOk = 0;
 constexpr int kExitBad = 1;
 constexpr int kExitUsage = 2;
@@ -18,6 +20,11 @@ int usage_error(const char* usage, const std::string& message);
 
 // Prints "ramdump_inspect: <file>: <problem>" on standard error; returns 1.
 int fail(const std::string& file, const std::string& problem);
+
+// Opens path read-only without waiting for a writer (a FIFO without one then reads as empty) and
+// without taking it as a controlling terminal, and fills *st. The descriptor, blocking again, or
+// -1 with errno.
+int open_input(const char* path, struct stat* st);
 
 // Parses a whole decimal (or 0x-prefixed hexadecimal, with hex true: plain hexadecimal) number
 // that fits 32 bits.

@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <stdio.h>
 #include <string.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <string>
@@ -93,7 +94,8 @@ int cmd_misc(int argc, char** argv) {
   }
   if (path == nullptr) return usage_error(kUsage, "no MISC given");
 
-  int fd = open(path, O_RDONLY | O_CLOEXEC);
+  struct stat st;
+  int fd = open_input(path, &st);
   if (fd < 0) return fail(path, strerror(errno));
   uint8_t items[kItems][INITIAL_BLOCK_HEADER_SIZE] = {};
   uint32_t end = 0;

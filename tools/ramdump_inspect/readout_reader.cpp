@@ -24,11 +24,14 @@ std::string hex32(uint32_t v) {
 
 int readout_open(readout_reader* r, const char* path, const char* what) {
   r->path = path;
-  r->fd = open(path, O_RDONLY | O_CLOEXEC);
-  if (r->fd < 0) return fail(path, strerror(errno));
   struct stat st = {};
-  if (fstat(r->fd, &st) != 0 || S_ISDIR(st.st_mode)) {
-    const std::string why = S_ISDIR(st.st_mode) ? "is a directory" : strerror(errno);
+  r->fd = open_input(path, &st);
+  if (r->fd < 0) {
+    fail(path, strerror(errno));
+    return -1;
+  }
+  if (S_ISDIR(st.st_mode)) {
+    const std::string why = "is a directory";
     close(r->fd);
     r->fd = -1;
     fail(path, why);

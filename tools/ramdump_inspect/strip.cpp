@@ -28,14 +28,17 @@ const char kUsage[] =
 // FILE opened for writing, refused when it is the read-out itself (truncating it would lose it).
 int open_target(const char* file, int readout_fd) {
   if (strcmp(file, "-") == 0) return STDOUT_FILENO;
-  int fd = open(file, O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+  // A FIFO without a reader fails at once (ENXIO) instead of waiting for one.
+  int fd = open(file, O_WRONLY | O_CREAT | O_NONBLOCK | O_CLOEXEC | O_NOCTTY, 0644);
   if (fd < 0) {
-    fail(file, strerror(errno));
+    fail(file, errno == ENXIO ? "a FIFO without a reader" : strerror(errno));
     return -1;
   }
   struct stat in, out;
   std::string problem;
-  if (fstat(fd, &out) != 0 || fstat(readout_fd, &in) != 0) {
+  const int flags = fcntl(fd, F_GETFL);
+  if (flags < 0 || fcntl(fd, F_SETFL, flags & ~O_NONBLOCK) != 0 || fstat(fd, &out) != 0 ||
+      fstat(readout_fd, &in) != 0) {
     problem = strerror(errno);
   } else if (in.st_dev == out.st_dev && in.st_ino == out.st_ino) {
     problem = "is the read-out itself";

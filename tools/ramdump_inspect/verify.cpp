@@ -175,7 +175,8 @@ void print_report(const chain_report& r, bool json, const char* kind, const char
 
 // The stored initial block header of MISC, which must name a chain.
 int stored_chain(const char* misc, initial_block_header* ibh) {
-  int fd = open(misc, O_RDONLY | O_CLOEXEC);
+  struct stat st;
+  int fd = open_input(misc, &st);
   if (fd < 0) return fail(misc, strerror(errno));
   int rc = read_stored_header(fd, ibh);
   int error = errno;
@@ -227,14 +228,9 @@ void check_file_block(file_check* c, uint64_t index, const uint8_t raw[CHAIN_BLO
 
 int verify_file(const char* path, bool json, uint32_t block_size, bool has_start,
                 uint32_t first_block, uint32_t initial_crc, bool has_count, uint32_t count) {
-  int fd = open(path, O_RDONLY | O_CLOEXEC);
-  if (fd < 0) return fail(path, strerror(errno));
   struct stat st;
-  if (fstat(fd, &st) != 0) {
-    int error = errno;
-    close(fd);
-    return fail(path, strerror(error));
-  }
+  int fd = open_input(path, &st);
+  if (fd < 0) return fail(path, strerror(errno));
   posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
   file_check c = {};
   c.has_start = has_start;
@@ -319,7 +315,8 @@ bool visit_device_block(void* context, uint32_t index, uint32_t block,
 int verify_device(const char* device, const char* misc, bool json) {
   initial_block_header ibh;
   if (int rc = stored_chain(misc, &ibh)) return rc;
-  int fd = open(device, O_RDONLY | O_CLOEXEC);
+  struct stat st;
+  int fd = open_input(device, &st);
   if (fd < 0) return fail(device, strerror(errno));
   device_check c = {};
   c.report.block0_checked = true;
