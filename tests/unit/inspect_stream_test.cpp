@@ -275,7 +275,6 @@ TEST_F(InspectStream, Usage) {
     std::string out, err;
   } rows[] = {
       {"list --help", 0, "usage: ramdump_inspect list [--json] OUTPUT\n", ""},
-      {"list", 2, "", "usage: ramdump_inspect list"},
       {"list --bogus " + readout_, 2, "", "unknown option '--bogus'\nusage: ramdump_inspect list"},
       {"extract " + readout_, 2, "", "usage: ramdump_inspect extract"},
       {"list " + dir_ + "/missing", 1, "", ": " + dir_ + "/missing: No such file or directory\n"},
