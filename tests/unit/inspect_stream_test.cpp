@@ -216,7 +216,7 @@ TEST_F(InspectStream, ExtractIntoExistingDirectory) {
       {'f', "", "", "x/memory0.bin: exists; --force replaces it", 1, "old", "log"},
       {'f', "--force", "", "", 0, "new", "log"},
       {'l', "--force", "", "exists and is not a regular file", 1, "-> " + outside, "log"},
-      {'d', "", "", "x: is not a directory", 1, "", ""},
+      {'d', "", "", "x: is a symbolic link, which is not followed", 1, "", ""},
       {' ', "", " kernel_log.bin", "", 0, "", "log"},
       {' ', "", " trace.bin", "no record named \"trace.bin\"", 1, "", ""},
   };

@@ -4,6 +4,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <inttypes.h>
+#include <limits.h>
 #include <stdio.h>
 #include <string.h>
 #include <sys/stat.h>
@@ -49,6 +50,8 @@ struct extract_state {
   int fd;          // the current record's file, or -1 while records are skipped
   std::string file, note;
   bool failed;
+  dev_t readout_dev;  // the read-out, which --force never replaces
+  ino_t readout_ino;
   progress* prog;  // cleared before a line is printed
 };
 
@@ -61,47 +64,78 @@ bool is_wanted(extract_state* st, const std::string& name, const std::string& fi
   return wanted;
 }
 
-// Flags of the names met.
+// Flags of the names met; the bits above them count the suffixes a name has given out.
 constexpr unsigned kRecordName = 1;  // a record's file name before any suffix
 constexpr unsigned kWritten = 2;     // written by this run, never replaced
+constexpr unsigned kSuffixStep = 4;
+
+// The next suffixed name for base. Its count only grows and skips the names this run wrote, so
+// each suffix of a base is tried once over the whole run. Without a count (the set is full) the
+// record's stream offset, which no other record of the stream has.
+std::string suffixed_name(extract_state* st, const std::string& base, unsigned* entry,
+                          uint64_t offset) {
+  if (entry == nullptr || *entry > UINT_MAX - kSuffixStep) {
+    return base + "." + std::to_string(offset);
+  }
+  for (;;) {
+    *entry += kSuffixStep;
+    std::string name = base + "." + std::to_string(*entry / kSuffixStep);
+    auto known = st->names.names.find(name);
+    if (known == st->names.names.end() || (known->second & kWritten) == 0) return name;
+  }
+}
 
 // Creates the file without following anything already there; with --force a regular file of
-// an earlier run is replaced. A repeated record name, or a name this run wrote, takes the next
-// free suffix; once the set of names is full any existing name does, as it may be this run's.
-int create_file(extract_state* st, const std::string& base) {
+// an earlier run is replaced, never the read-out itself. A repeated record name, or a name this
+// run wrote, takes the next suffix; once the set of names is full an existing name may be this
+// run's, so it is never replaced then: one other name is tried, then the record is left out.
+int create_file(extract_state* st, const std::string& base, uint64_t offset) {
   unsigned* entry = name_set_entry(&st->names, base);
   const bool repeated = entry != nullptr && (*entry & kRecordName) != 0;
+  const bool taken = entry != nullptr && (*entry & kWritten) != 0;
   if (entry != nullptr) *entry |= kRecordName;
-  for (uint64_t suffix = repeated ? 1 : 0;; ++suffix) {
-    st->file = suffix == 0 ? base : base + "." + std::to_string(suffix);
-    auto known = st->names.names.find(st->file);
-    if (known != st->names.names.end() && (known->second & kWritten) != 0) continue;
-    const char* file = st->file.c_str();
-    int fd = openat(st->dir_fd, file, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644);
-    if (fd >= 0 || errno != EEXIST) return fd;
-    if (st->names.full) continue;
-    struct stat s;
-    if (!st->force) {
-      errno = EEXIST;
-      return -1;
+  st->file = repeated || taken ? suffixed_name(st, base, entry, offset) : base;
+  const int flags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
+  int fd = openat(st->dir_fd, st->file.c_str(), flags, 0644);
+  if (fd >= 0 || errno != EEXIST) return fd;
+  if (st->names.full) {
+    if (st->file == base) {
+      st->file = suffixed_name(st, base, nullptr, offset);
+      fd = openat(st->dir_fd, st->file.c_str(), flags, 0644);
+      if (fd >= 0 || errno != EEXIST) return fd;
     }
-    if (fstatat(st->dir_fd, file, &s, AT_SYMLINK_NOFOLLOW) == 0 && !S_ISREG(s.st_mode)) {
+    errno = EEXIST;
+    return -1;
+  }
+  if (!st->force) {
+    errno = EEXIST;
+    return -1;
+  }
+  const char* file = st->file.c_str();
+  struct stat s;
+  if (fstatat(st->dir_fd, file, &s, AT_SYMLINK_NOFOLLOW) == 0) {
+    if (!S_ISREG(s.st_mode)) {
       errno = EPERM;
       return -1;
     }
-    if (unlinkat(st->dir_fd, file, 0) != 0 && errno != ENOENT) return -1;
-    return openat(st->dir_fd, file, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644);
+    if (s.st_dev == st->readout_dev && s.st_ino == st->readout_ino) {
+      errno = EBUSY;
+      return -1;
+    }
   }
+  if (unlinkat(st->dir_fd, file, 0) != 0 && errno != ENOENT) return -1;
+  return openat(st->dir_fd, file, flags, 0644);
 }
 
 int on_header(void* ctx, const dump_stream_record& r) {
   extract_state* st = static_cast<extract_state*>(ctx);
   const std::string name = record_name(r), base = record_file_name(r);
   if (!is_wanted(st, name, base)) return 0;
-  st->fd = create_file(st, base);
+  st->fd = create_file(st, base, r.offset);
   if (st->fd < 0) {
     const std::string why = errno == EEXIST  ? "exists; --force replaces it"
                             : errno == EPERM ? "exists and is not a regular file; left alone"
+                            : errno == EBUSY ? "is the read-out being read; left alone"
                                              : strerror(errno);
     st->failed = true;
     fail(std::string(st->dir) + "/" + st->file, why);
@@ -186,18 +220,37 @@ int cmd_extract(int argc, char** argv) {
   st.wanted.assign(argv + i + 2, argv + argc);
   st.found.assign(st.wanted.size(), false);
 
+  // Opened first, so that an unreadable read-out leaves no directory behind.
+  readout_reader reader;
+  if (readout_open(&reader, path, "extract") != 0) return kExitBad;
+  struct stat in;
+  if (fstat(reader.fd, &in) != 0) {
+    fail(path, strerror(errno));
+    readout_close(&reader);
+    return kExitBad;
+  }
+  st.readout_dev = in.st_dev;
+  st.readout_ino = in.st_ino;
+  // A trailing slash would make the last component be followed when it is a symbolic link.
+  std::string dir = st.dir;
+  while (dir.size() > 1 && dir.back() == '/') dir.pop_back();
+  st.dir = dir.c_str();
   if (mkdir(st.dir, 0755) != 0 && errno != EEXIST) {
-    return fail(st.dir, std::string("cannot be created: ") + strerror(errno));
+    fail(st.dir, std::string("cannot be created: ") + strerror(errno));
+    readout_close(&reader);
+    return kExitBad;
   }
   st.dir_fd = open(st.dir, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
   if (st.dir_fd < 0) {
-    return fail(st.dir, errno == ELOOP || errno == ENOTDIR
-                            ? "is not a directory (a symbolic link is not followed)"
-                            : strerror(errno));
-  }
-  readout_reader reader;
-  if (readout_open(&reader, path, "extract") != 0) {
-    close(st.dir_fd);
+    // O_DIRECTORY fails a symbolic link as ENOTDIR before O_NOFOLLOW can say ELOOP.
+    const int error = errno;
+    struct stat link;
+    const bool is_link =
+        error == ELOOP || (error == ENOTDIR && lstat(st.dir, &link) == 0 && S_ISLNK(link.st_mode));
+    fail(st.dir, is_link            ? "is a symbolic link, which is not followed"
+                 : error == ENOTDIR ? "is not a directory"
+                                    : strerror(error));
+    readout_close(&reader);
     return kExitBad;
   }
   st.prog = &reader.prog;
