@@ -154,6 +154,14 @@ int readout_parse(readout_reader* r, dump_stream* s, const dump_stream_sink& sin
     // What follows the stream's end matters to neither.
     if (dump_stream_ended(*s) && (device == nullptr || device->stopped)) break;
   }
+  // A bad chain magic counts only in a unit that the stream (or the model) reached, so the
+  // result does not depend on where a read of READ_UNITS happened to end.
+  if (r->bad_chain_magic && dump_stream_ended(*s)) {
+    const uint64_t last = s->end_offset + (s->bad_magic_length > 0 ? s->bad_magic_length - 1 : 0);
+    uint64_t reached = last / UNIT_PAYLOAD_SIZE + 1;
+    if (device != nullptr && device->units > reached) reached = device->units;
+    if (r->units >= reached) r->bad_chain_magic = false;  // r->units: the bad unit's index
+  }
   return dump_stream_finish(s, sink);
 }
 

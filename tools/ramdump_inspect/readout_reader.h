@@ -61,6 +61,7 @@ size_t join_payloads(uint8_t* units, size_t count);
 // ended and so has the model of the tool's extraction when one is given. The model takes each
 // unit as read, and the parser then takes the unit's payload; without a model the payloads of
 // each read are joined first, so that a record's content in one read comes as one piece.
+// A bad chain magic in a unit after the one where both ended is not a problem of the read-out.
 // Returns 0, or the sink's first negative result.
 int readout_parse(readout_reader* r, dump_stream* s, const dump_stream_sink& sink,
                   device_extraction* device);
