@@ -244,7 +244,10 @@ int verify_file(const char* path, bool json, uint32_t block_size, bool has_start
   uint32_t in_block = 0;
   uint64_t done = 0;
   progress p = progress_begin("verify", static_cast<uint64_t>(st.st_size));
-  for (;;) {
+  // Reading stops at the first bad magic, and past the stored count after one block more, so
+  // that an endless input (a character device, a pipe) ends too.
+  bool stopped = false;
+  while (!stopped) {
     ssize_t n = read(fd, buffer.data(), buffer.size());
     if (n < 0 && errno == EINTR) continue;
     if (n < 0) {
@@ -256,7 +259,7 @@ int verify_file(const char* path, bool json, uint32_t block_size, bool has_start
     if (n == 0) break;
     const uint8_t* data = buffer.data();
     size_t left = static_cast<size_t>(n);
-    while (left > 0) {
+    while (left > 0 && !stopped) {
       size_t take;
       if (in_block < CHAIN_BLOCK_HEADER_SIZE) {
         take = std::min<size_t>(CHAIN_BLOCK_HEADER_SIZE - in_block, left);
@@ -270,6 +273,7 @@ int verify_file(const char* path, bool json, uint32_t block_size, bool has_start
       if (in_block == block_size) {
         check_file_block(&c, c.report.blocks, header);
         in_block = 0;
+        stopped = c.previous.magic != CHAIN_BLOCK_MAGIC || (has_count && c.report.blocks > count);
       }
     }
     done += static_cast<uint64_t>(n);
@@ -283,9 +287,15 @@ int verify_file(const char* path, bool json, uint32_t block_size, bool has_start
     note_bad(r, r->blocks - 1, c.previous_own_known, c.previous_own,
              "the chain does not end: next_block " + std::to_string(c.previous.next_block));
   }
-  if (in_block != 0) {
-    note_bad(r, kWholeChain, false, 0,
-             std::to_string(in_block) + " bytes after the last whole block");
+  // A regular file's partial last block is reported even when the reading stopped before it,
+  // and always on standard error too, whatever problem came first.
+  const uint64_t partial = S_ISREG(st.st_mode) ? static_cast<uint64_t>(st.st_size) % block_size
+                           : stopped           ? 0
+                                               : in_block;
+  if (partial != 0) {
+    const std::string text = std::to_string(partial) + " bytes after the last whole block";
+    note_bad(r, kWholeChain, false, 0, text);
+    fail(path, text + ", ignored");
   }
   if (r->blocks == 0) note_bad(r, kWholeChain, false, 0, "no whole block");
   if (has_count && r->blocks != count) {
