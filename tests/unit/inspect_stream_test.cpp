@@ -3,6 +3,7 @@
 #include <android/log.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -268,7 +269,11 @@ TEST_F(InspectStream, ModelOfTheToolsExtraction) {
 }
 
 TEST_F(InspectStream, Usage) {
-  write_host_file(readout_, readout_units(stream_of({{"memory0.bin", "m"}})));
+  const std::string readout =
+      readout_units(stream_of({{"memory0.bin", "m"}, {"RAMDUMP_OUTPUT", "r"}}));
+  write_host_file(readout_, readout);
+  const std::string fifo = dir_ + "/fifo";
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
   struct {
     std::string args;
     int status;
@@ -280,6 +285,10 @@ TEST_F(InspectStream, Usage) {
       {"list " + dir_ + "/missing", 1, "", ": " + dir_ + "/missing: No such file or directory\n"},
       {"extract " + readout_ + " " + dir_ + "/no/x", 1, "", "/no/x: cannot be created"},
       {"strip " + readout_ + " " + readout_, 1, "", "is the read-out itself\n"},
+      {"list " + fifo, 0, "no records", ""},
+      {"strip " + readout_ + " " + fifo, 1, "", "a FIFO without a reader\n"},
+      {"extract --force " + readout_ + " " + dir_, 1, "memory0.bin: 1 bytes",
+       "RAMDUMP_OUTPUT: is the read-out being read"},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.args);
@@ -291,7 +300,7 @@ TEST_F(InspectStream, Usage) {
       EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
     }
   }
-  EXPECT_EQ(read_host_file(readout_), readout_units(stream_of({{"memory0.bin", "m"}})));
+  EXPECT_EQ(read_host_file(readout_), readout);
 }
 
 }  // namespace
