@@ -58,7 +58,10 @@ int walk_chain(int fd, const initial_block_header& ibh, chain_visitor visit, voi
     result->block = block;
     if (block == 0) return WALK_ENDS_EARLY;
     uint8_t raw[CHAIN_BLOCK_HEADER_SIZE];
-    if (pread_full(fd, raw, sizeof(raw), static_cast<off_t>(block) * ibh.block_size) != 0) {
+    // A hostile header can name a block whose offset no off_t holds.
+    const uint64_t offset = static_cast<uint64_t>(block) * ibh.block_size;
+    if (offset > static_cast<uint64_t>(INT64_MAX)) return WALK_BEYOND_DEVICE;
+    if (pread_full(fd, raw, sizeof(raw), static_cast<off_t>(offset)) != 0) {
       result->error = errno;
       return WALK_READ_FAILED;
     }
@@ -102,6 +105,10 @@ std::string walk_problem(int status, const chain_walk_result& r, const initial_b
     case WALK_TOO_LONG:
       snprintf(line, sizeof(line), "chain goes on past its %u blocks (to block %u)",
                ibh.block_count, r.block);
+      break;
+    case WALK_BEYOND_DEVICE:
+      snprintf(line, sizeof(line), "block %u (chain block %u): offset beyond the device", r.block,
+               r.blocks);
       break;
     case WALK_BAD_BLOCK_SIZE:
       snprintf(line, sizeof(line), "block size %u is smaller than a chain block header",

@@ -37,6 +37,7 @@ enum chain_walk_status {
   WALK_ENDS_EARLY = -4,  // next_block 0 before block_count blocks
   WALK_TOO_LONG = -5,    // next_block not 0 after block_count blocks (a loop, among others)
   WALK_BAD_BLOCK_SIZE = -6,
+  WALK_BEYOND_DEVICE = -7,  // the block's offset exceeds any file offset
 };
 
 struct chain_walk_result {

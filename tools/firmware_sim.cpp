@@ -205,6 +205,11 @@ int main(int argc, char** argv) {
   }
 
   // Every file is opened and measured before anything is written.
+  const uint64_t capacity = static_cast<uint64_t>(walk.blocks) * kPayload;
+  if (filler && first_record_at > capacity) {
+    return failure(dev_path, "--first-record-at " + std::to_string(first_record_at) +
+                                 " is past the chain's " + std::to_string(capacity) + " bytes");
+  }
   std::vector<record> records;
   uint64_t stream_size = 0;
   if (filler) {
@@ -225,11 +230,17 @@ int main(int argc, char** argv) {
       return 1;
     }
   }
-  for (const record& r : records) stream_size += DUMP_FILE_RECORD_SIZE + r.size;
-  const uint64_t capacity = static_cast<uint64_t>(walk.blocks) * kPayload;
-  if (stream_size > capacity) {
-    fprintf(stderr, "firmware_sim: %s: a dump of %llu bytes does not fit the chain's %llu bytes\n",
-            dev_path, static_cast<unsigned long long>(stream_size),
+  // Each size is checked against the room left, so the sum cannot overflow.
+  bool fits = true;
+  for (const record& r : records) {
+    if (r.size > capacity || DUMP_FILE_RECORD_SIZE + r.size > capacity - stream_size) {
+      fits = false;
+      break;
+    }
+    stream_size += DUMP_FILE_RECORD_SIZE + r.size;
+  }
+  if (!fits) {
+    fprintf(stderr, "firmware_sim: %s: the dump does not fit the chain's %llu bytes\n", dev_path,
             static_cast<unsigned long long>(capacity));
     return 1;
   }

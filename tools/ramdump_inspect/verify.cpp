@@ -311,6 +311,7 @@ struct device_check {
   chain_report report;
   progress meter;
   uint32_t block_size;
+  uint32_t last_block;  // of the last chain block seen
 };
 
 bool visit_device_block(void* context, uint32_t index, uint32_t block,
@@ -318,6 +319,7 @@ bool visit_device_block(void* context, uint32_t index, uint32_t block,
   device_check* c = static_cast<device_check*>(context);
   note_block(&c->report, index, true, block, header);
   ++c->report.blocks;
+  c->last_block = block;
   progress_update(&c->meter, static_cast<uint64_t>(c->report.blocks) * c->block_size);
   return true;
 }
@@ -348,6 +350,20 @@ int verify_device(const char* device, const char* misc, bool json) {
       break;
     case WALK_BAD_CRC:
       note_bad(r, walk.blocks, true, walk.block, crc_problem(walk.found, walk.expected));
+      break;
+    case WALK_BEYOND_DEVICE:
+      note_bad(r, walk.blocks, true, walk.block, "offset beyond the device");
+      break;
+    case WALK_ENDS_EARLY:
+    case WALK_TOO_LONG:
+      // The last block seen is the one whose next_block is wrong.
+      if (walk.blocks > 0) {
+        note_bad(
+            r, walk.blocks - 1, true, c.last_block,
+            "next_block " + std::to_string(walk.block) + ": " + walk_problem(status, walk, ibh));
+        break;
+      }
+      note_bad(r, kWholeChain, false, 0, walk_problem(status, walk, ibh));
       break;
     default:
       note_bad(r, kWholeChain, false, 0, walk_problem(status, walk, ibh));
