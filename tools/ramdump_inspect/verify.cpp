@@ -58,6 +58,7 @@ struct chain_report {
   uint32_t longest;
   uint64_t histogram[kBuckets];
   uint32_t run_left;  // blocks the current run still holds after the last one seen
+  uint32_t run_seen;  // blocks of the current run seen: runs count as read, not as claimed
   bool block0_checked;
   bool bad;
   uint64_t bad_index;
@@ -89,6 +90,14 @@ std::string crc_problem(uint32_t found, uint32_t expected) {
   return text;
 }
 
+// The current run, as far as it was seen, into the longest and the histogram.
+void end_run(chain_report* r) {
+  if (r->run_seen == 0) return;
+  ++r->histogram[bucket_of(r->run_seen)];
+  r->longest = std::max(r->longest, r->run_seen);
+  r->run_seen = 0;
+}
+
 // The run checks of one block whose magic holds, and the run counts. own is the block's own
 // number when known (every block but the first of a read-out given alone).
 void note_block(chain_report* r, uint64_t index, bool own_known, uint32_t own,
@@ -111,9 +120,13 @@ void note_block(chain_report* r, uint64_t index, bool own_known, uint32_t own,
   }
   // A block that does not continue the run it is in starts one of its own.
   if (in_range && r->run_left != remaining) {
+    end_run(r);
     ++r->runs;
-    ++r->histogram[bucket_of(remaining)];
-    r->longest = std::max(r->longest, remaining);
+    r->run_seen = 1;
+  } else if (in_range) {
+    ++r->run_seen;
+  } else {
+    end_run(r);
   }
   r->run_left = in_range ? remaining - 1 : 0;
 }
@@ -303,6 +316,7 @@ int verify_file(const char* path, bool json, uint32_t block_size, bool has_start
              std::to_string(r->blocks) + " blocks, but the stored header counts " +
                  std::to_string(count));
   }
+  end_run(r);
   print_report(*r, json, "read-out", path, block_size);
   return r->bad ? kExitBad : kExitOk;
 }
@@ -369,6 +383,7 @@ int verify_device(const char* device, const char* misc, bool json) {
       note_bad(r, kWholeChain, false, 0, walk_problem(status, walk, ibh));
       break;
   }
+  end_run(r);
   print_report(*r, json, "device", device, ibh.block_size);
   return r->bad ? kExitBad : kExitOk;
 }
