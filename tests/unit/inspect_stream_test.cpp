@@ -129,13 +129,13 @@ TEST_F(InspectStream, StreamsAndEndings) {
   rows.insert(rows.end(),
               {partial,
                {cut, readout_units(stream_of(cut)), "inside a record at stream offset 8160", 8160,
-                "end_of_data", 1, 0},
+                "cut_record", 1, 0},
                {huge, readout_units(stream_of(huge)), "inside a record at stream offset 4080", 4080,
-                "end_of_data", 1, 0},
+                "cut_record", 1, 0},
                {chain, bad_chain, "unit 1 at offset 4096 has chain block magic 6f684358", 4080,
                 "bad_chain_magic", 1, 1},
                {head, readout_units(cut_head), "inside a record header at stream offset 4060", 4060,
-                "end_of_data", 1, 0}});
+                "cut_header", 1, 0}});
   for (const Row& row : rows) {
     SCOPED_TRACE(row.err + " " + std::to_string(row.end));
     write_host_file(readout_, row.readout);

@@ -144,7 +144,16 @@ std::string dump_stream_end_text(const dump_stream& s) {
 }
 
 const char* dump_stream_end_token(const dump_stream& s) {
-  return s.state == STREAM_BAD_MAGIC ? "bad_magic" : "end_of_data";
+  switch (s.state) {
+    case STREAM_BAD_MAGIC:
+      return "bad_magic";
+    case STREAM_CUT_HEADER:
+      return "cut_header";
+    case STREAM_CUT_CONTENT:
+      return "cut_record";
+    default:
+      return "end_of_data";
+  }
 }
 
 std::string record_name(const dump_stream_record& r) {
