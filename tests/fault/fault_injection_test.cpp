@@ -215,6 +215,8 @@ std::vector<Case> cases() {
       I("Read 0 blocks successfully")}, {}, nullptr},
     {"EIO writing the read-out: it stops", "write.data=EIO#1", {"-r", kOut, kArmed}, 255,
      std::nullopt, {E("error writing: Input/output error")}, {kOut}, nullptr},
+    {"EIO reading the device: the read-out stops", "read.dev=EIO+2", {"-r", kOut, kArmed}, 255,
+     std::nullopt, {E("error reading: Input/output error")}, {kOut}, nullptr},
     {"FIBMAP fails for logical block 5: read-out stops there", "fibmap=EINVAL@5",
      {"-r", kOut, kArmed}, 255, "", {E("failed to find block 5")}, {kOut}, nullptr, nullptr,
      [](Context& c) { EXPECT_EQ(c.device.read_file(kOut), raw_blocks(c.device, {c.armed.begin(), c.armed.begin() + 5})); }},
