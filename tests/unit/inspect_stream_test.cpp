@@ -177,10 +177,15 @@ TEST_F(InspectStream, UnsafeAndRepeatedNames) {
   write_host_file(readout_, readout_units(stream_of(recs)));
   RunResult r = inspect("extract " + readout_ + " " + dir_ + "/x");
   EXPECT_EQ(r.status, 0) << r.err;
-  const std::map<std::string, std::string> want = {
-      {"kernel_log.bin", "a"},       {"kernel_log.bin.1", "b"},   {".._.._escape", "c"},
-      {"record_123", "d"},           {"record_164", "e"},         {"ttyS0_log", "f"},
-      {"abcdefghijklmnopqrst", "g"}, {"kernel_log.bin.1.1", "h"}, {"_", "i"}};
+  const std::map<std::string, std::string> want = {{"kernel_log.bin", "a"},
+                                                   {"kernel_log.bin.1", "b"},
+                                                   {".._.._escape", "c"},
+                                                   {"record_123", "d"},
+                                                   {"record_164", "e"},
+                                                   {"ttyS0_log", "f"},
+                                                   {"abcdefghijklmnopqrst_", "g"},
+                                                   {"kernel_log.bin.1.1", "h"},
+                                                   {"_", "i"}};
   EXPECT_EQ(files(dir_ + "/x"), want);
   EXPECT_EQ(files(dir_).size(), want.size() + 3);  // the read-out, stderr, x
   EXPECT_FALSE(fs::exists(fs::path(dir_).parent_path() / "escape"));

@@ -179,6 +179,8 @@ std::string record_file_name(const dump_stream_record& r) {
   if (name.empty() || name == "." || name == "..") {
     name = "record_" + std::to_string(r.offset);
   }
+  // All 20 bytes without a terminator may be a name cut short: the file name says so.
+  if (record_name_problems(r) & NAME_NO_TERMINATOR) name += '_';
   return name;
 }
 

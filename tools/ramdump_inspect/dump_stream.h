@@ -86,7 +86,7 @@ std::string record_name(const dump_stream_record& r);
 unsigned record_name_problems(const dump_stream_record& r);
 // The name under which a record may be written into a directory: the name itself when it has no
 // problem, otherwise its bytes with every unsafe one as '_', or "record_<offset>" where that
-// leaves nothing usable.
+// leaves nothing usable; a name without terminator gets a '_' appended.
 std::string record_file_name(const dump_stream_record& r);
 
 // Names met so far, each with flags of the caller's. Bounded so that a stream of millions of
