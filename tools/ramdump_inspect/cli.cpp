@@ -16,6 +16,28 @@ bool wants_help(int argc, char** argv) {
   return false;
 }
 
+std::string split_args(int argc, char** argv, const char* const* flags, unsigned* seen,
+                       std::vector<const char*>* operands) {
+  *seen = 0;
+  bool options = true;
+  for (int i = 1; i < argc; ++i) {
+    const char* arg = argv[i];
+    if (!options || arg[0] != '-' || arg[1] == '\0') {
+      operands->push_back(arg);
+      continue;
+    }
+    if (strcmp(arg, "--") == 0) {
+      options = false;
+      continue;
+    }
+    unsigned f = 0;
+    while (flags[f] != nullptr && strcmp(flags[f], arg) != 0) ++f;
+    if (flags[f] == nullptr) return std::string("unknown option '") + arg + "'";
+    *seen |= 1u << f;
+  }
+  return "";
+}
+
 int usage_error(const char* usage, const std::string& message) {
   fprintf(stderr, "ramdump_inspect: %s\n%s", message.c_str(), usage);
   return kExitUsage;

@@ -204,21 +204,16 @@ int cmd_extract(int argc, char** argv) {
   }
   extract_state st = {};
   st.fd = -1;
-  int i = 1;
-  for (; i < argc && argv[i][0] == '-' && argv[i][1] != '\0'; ++i) {
-    if (strcmp(argv[i], "--") == 0) {
-      ++i;
-      break;
-    }
-    if (strcmp(argv[i], "--force") != 0) {
-      return usage_error(kUsage, std::string("unknown option '") + argv[i] + "'");
-    }
-    st.force = true;
-  }
-  if (argc - i < 2) return usage_error(kUsage, "extract takes OUTPUT and DIR");
-  const char* path = argv[i];
-  st.dir = argv[i + 1];
-  st.wanted.assign(argv + i + 2, argv + argc);
+  static const char* const kFlags[] = {"--force", nullptr};
+  unsigned seen;
+  std::vector<const char*> operands;
+  const std::string problem = split_args(argc, argv, kFlags, &seen, &operands);
+  if (!problem.empty()) return usage_error(kUsage, problem);
+  st.force = seen != 0;
+  if (operands.size() < 2) return usage_error(kUsage, "extract takes OUTPUT and DIR");
+  const char* path = operands[0];
+  st.dir = operands[1];
+  st.wanted.assign(operands.begin() + 2, operands.end());
   st.found.assign(st.wanted.size(), false);
 
   // Opened first, so that an unreadable read-out leaves no directory behind.

@@ -95,13 +95,14 @@ int cmd_list(int argc, char** argv) {
     return kExitOk;
   }
   list_state st = {false, 0, {}, nullptr};
-  int i = 1;
-  if (i < argc && strcmp(argv[i], "--json") == 0) st.json = true, ++i;
-  if (i < argc && argv[i][0] == '-' && argv[i][1] != '\0') {
-    return usage_error(kUsage, std::string("unknown option '") + argv[i] + "'");
-  }
-  if (argc - i != 1) return usage_error(kUsage, "list takes one OUTPUT");
-  const char* path = argv[i];
+  static const char* const kFlags[] = {"--json", nullptr};
+  unsigned seen;
+  std::vector<const char*> operands;
+  const std::string problem = split_args(argc, argv, kFlags, &seen, &operands);
+  if (!problem.empty()) return usage_error(kUsage, problem);
+  st.json = seen != 0;
+  if (operands.size() != 1) return usage_error(kUsage, "list takes one OUTPUT");
+  const char* path = operands[0];
 
   readout_reader reader;
   if (readout_open(&reader, path, "list") != 0) return kExitBad;

@@ -58,11 +58,13 @@ int cmd_strip(int argc, char** argv) {
     fputs(kUsage, stdout);
     return kExitOk;
   }
-  if (argc > 1 && argv[1][0] == '-' && argv[1][1] != '\0') {
-    return usage_error(kUsage, std::string("unknown option '") + argv[1] + "'");
-  }
-  if (argc != 3) return usage_error(kUsage, "strip takes OUTPUT and FILE");
-  const char *path = argv[1], *file = argv[2];
+  static const char* const kFlags[] = {nullptr};
+  unsigned seen;
+  std::vector<const char*> operands;
+  const std::string problem = split_args(argc, argv, kFlags, &seen, &operands);
+  if (!problem.empty()) return usage_error(kUsage, problem);
+  if (operands.size() != 2) return usage_error(kUsage, "strip takes OUTPUT and FILE");
+  const char *path = operands[0], *file = operands[1];
 
   readout_reader reader;
   if (readout_open(&reader, path, "strip") != 0) return kExitBad;
