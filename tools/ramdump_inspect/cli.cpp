@@ -16,8 +16,8 @@ bool wants_help(int argc, char** argv) {
   return false;
 }
 
-std::string split_args(int argc, char** argv, const char* const* flags, unsigned* seen,
-                       std::vector<const char*>* operands) {
+bool split_args(int argc, char** argv, const char* const* flags, const char* usage, unsigned* seen,
+                std::vector<const char*>* operands) {
   *seen = 0;
   bool options = true;
   for (int i = 1; i < argc; ++i) {
@@ -32,10 +32,13 @@ std::string split_args(int argc, char** argv, const char* const* flags, unsigned
     }
     unsigned f = 0;
     while (flags[f] != nullptr && strcmp(flags[f], arg) != 0) ++f;
-    if (flags[f] == nullptr) return std::string("unknown option '") + arg + "'";
+    if (flags[f] == nullptr) {
+      usage_error(usage, std::string("unknown option '") + arg + "'");
+      return false;
+    }
     *seen |= 1u << f;
   }
-  return "";
+  return true;
 }
 
 int usage_error(const char* usage, const std::string& message) {

@@ -18,9 +18,9 @@ bool wants_help(int argc, char** argv);
 
 // Splits argv[1..] into options and operands, options accepted anywhere before "--": each one
 // must be among flags (a null-terminated list) and sets bit i of *seen for flags[i]; "-" alone is
-// an operand. Returns "" or the problem for usage_error.
-std::string split_args(int argc, char** argv, const char* const* flags, unsigned* seen,
-                       std::vector<const char*>* operands);
+// an operand. False after a usage error for an unknown option.
+bool split_args(int argc, char** argv, const char* const* flags, const char* usage, unsigned* seen,
+                std::vector<const char*>* operands);
 
 // Prints "ramdump_inspect: <message>" and then the usage to standard error; returns 2.
 int usage_error(const char* usage, const std::string& message);

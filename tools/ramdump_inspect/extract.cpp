@@ -207,8 +207,7 @@ int cmd_extract(int argc, char** argv) {
   static const char* const kFlags[] = {"--force", nullptr};
   unsigned seen;
   std::vector<const char*> operands;
-  const std::string problem = split_args(argc, argv, kFlags, &seen, &operands);
-  if (!problem.empty()) return usage_error(kUsage, problem);
+  if (!split_args(argc, argv, kFlags, kUsage, &seen, &operands)) return kExitUsage;
   st.force = seen != 0;
   if (operands.size() < 2) return usage_error(kUsage, "extract takes OUTPUT and DIR");
   const char* path = operands[0];

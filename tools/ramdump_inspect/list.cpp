@@ -98,8 +98,7 @@ int cmd_list(int argc, char** argv) {
   static const char* const kFlags[] = {"--json", nullptr};
   unsigned seen;
   std::vector<const char*> operands;
-  const std::string problem = split_args(argc, argv, kFlags, &seen, &operands);
-  if (!problem.empty()) return usage_error(kUsage, problem);
+  if (!split_args(argc, argv, kFlags, kUsage, &seen, &operands)) return kExitUsage;
   st.json = seen != 0;
   if (operands.size() != 1) return usage_error(kUsage, "list takes one OUTPUT");
   const char* path = operands[0];

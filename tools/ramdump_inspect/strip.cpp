@@ -61,8 +61,7 @@ int cmd_strip(int argc, char** argv) {
   static const char* const kFlags[] = {nullptr};
   unsigned seen;
   std::vector<const char*> operands;
-  const std::string problem = split_args(argc, argv, kFlags, &seen, &operands);
-  if (!problem.empty()) return usage_error(kUsage, problem);
+  if (!split_args(argc, argv, kFlags, kUsage, &seen, &operands)) return kExitUsage;
   if (operands.size() != 2) return usage_error(kUsage, "strip takes OUTPUT and FILE");
   const char *path = operands[0], *file = operands[1];
 
