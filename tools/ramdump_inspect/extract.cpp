@@ -139,6 +139,7 @@ int on_header(void* ctx, const dump_stream_record& r) {
                             : errno == EBUSY ? "is the read-out being read; left alone"
                                              : strerror(errno);
     st->failed = true;
+    progress_end(st->prog);
     fail(std::string(st->dir) + "/" + st->file, why);
     return 0;
   }
@@ -160,6 +161,7 @@ int on_header(void* ctx, const dump_stream_record& r) {
 int on_content(void* ctx, const uint8_t* data, size_t length) {
   extract_state* st = static_cast<extract_state*>(ctx);
   if (st->fd < 0 || write_all(st->fd, data, length) == 0) return 0;
+  progress_end(st->prog);
   fail(std::string(st->dir) + "/" + st->file, std::string("write failed: ") + strerror(errno));
   close(st->fd);
   st->fd = -1;
@@ -175,6 +177,7 @@ int on_record_end(void* ctx, const dump_stream_record& r, bool complete, uint64_
   st->fd = -1;
   if (closed != 0) {
     st->failed = true;
+    progress_end(st->prog);
     fail(path, std::string("write failed: ") + strerror(errno));
     return -1;
   }
