@@ -1,6 +1,7 @@
 // The command line and the feature switch (-s, -e, -d) on the real binary, and the misc item
 // store on the partition image, inside the fake device root.
 #include <dirent.h>
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -30,6 +31,9 @@ const char kUsage[] =
     "exist, otherwise, use the -c option to create the file before\nconverting it.\n";
 
 const std::string kOpenFailed = std::string("Error: ") + MISC_DEVICE + " open failed.\n";
+const char kEnableFailed[] =
+    "E reserveblocks: error writing ramdump enable flag to MISC partition\\n\n"
+    "E reserveblocks: failed to enable ramdump\\n\n";
 
 std::string patched(std::string image, size_t offset, const std::string& bytes) {
   return image.replace(offset, bytes.size(), bytes);
@@ -64,12 +68,7 @@ TEST(SwitchModes, CommandLinesAndTheItemsEachModeWrites) {
        kOpenFailed + "Error: open partition failed, item=3\nRamdump disabled\n",
        "",
        "E reserveblocks: error reading ramdump enable flag from MISC partition\\n\n"},
-      {{"-e"},
-       1,
-       kOpenFailed + "Error: open partition failed, item=3.\n",
-       "",
-       "E reserveblocks: error writing ramdump enable flag to MISC partition\\n\n"
-       "E reserveblocks: failed to enable ramdump\\n\n"},
+      {{"-e"}, 1, kOpenFailed + "Error: open partition failed, item=3.\n", "", kEnableFailed},
       {{"-d"},
        1,
        kOpenFailed + "Error: open partition failed, item=2.\n",
@@ -90,39 +89,25 @@ TEST(SwitchModes, CommandLinesAndTheItemsEachModeWrites) {
       EXPECT_EQ(device.log(), step.log) << shown;
     }
   }
-}
-
-// A build host has no log daemon or property service: the log file and the property directory
-// are used only where they exist (the fake root has both). Without them the messages go to
-// standard error and nothing is created in /dev.
-TEST(SwitchModes, HostWithoutLogFileOrPropertyDirectory) {
-  FakeDevice device;
-  REQUIRE_DEVICE(device);
-  write_host_file(device.misc_host_path(), patched(device.misc_bytes(), 3216, "DiSa"));
+  // A build host has neither a log daemon nor a property service: without the log file the
+  // records go to standard error, and nothing is created in /dev.
   device.remove("/dev/__log__");
   device.remove("/dev/__properties__");
-  RunResult boot = device.run({"-a"});
-  EXPECT_EQ(boot.status, 255);
-  EXPECT_EQ(boot.err,
-            "I reserveblocks: Ramdump is disabled, deleting ramdump reserved file: "
-            "/data/vendor/ramdump/RAMDUMP_RESERVED\\n\n"
-            "E reserveblocks: Failed to delete /data/vendor/ramdump/RAMDUMP_RESERVED: No such file "
-            "or directory\\n\n"
-            "I reserveblocks: Ramdump is disabled, deleting ramdump output file: "
-            "/data/vendor/ramdump/apq/00/RAMDUMP_OUTPUT\\n\n");
-  EXPECT_FALSE(device.exists("/dev/__log__"));
-  EXPECT_FALSE(device.exists("/dev/__properties__"));
+  EXPECT_EQ(device.run({"-e"}).err, kEnableFailed);
+  EXPECT_FALSE(device.exists("/dev/__log__") || device.exists("/dev/__properties__"));
 }
 
 // One access per row, in a process of its own, on an image whose byte i is i % 251, with a
 // 32-byte buffer of 0xEE (reads) or of 1, 2, 3... (writes). A read brings the item's whole
 // length, a write changes exactly the item; a failed access moves nothing; no access leaves
-// the partition open.
+// the partition open. The path is settled at the first access of a process: the primary one if
+// it opens then, with no fallback afterwards, else the secondary one for good.
 TEST(MiscStore, ItemAccess) {
   FakeDevice device;
   REQUIRE_DEVICE(device);
   std::string image(1 << 20, '\0');
   for (size_t i = 0; i < image.size(); ++i) image[i] = static_cast<char>(i % 251);
+  device.write_file(MISC_PATH_PRIMARY, "");  // its directory
   uint32_t offset, length;
   const struct {
     std::function<int(uint8_t*)> access;
@@ -130,7 +115,7 @@ TEST(MiscStore, ItemAccess) {
     bool write;
     size_t offset, length;  // of the bytes moved
     std::string out = "";
-    bool partition = true;
+    bool partition = true, primary = false;
   } cases[] = {
       {[](uint8_t* b) { return MISC_read_RamdumpEnable(b); }, 0, false, 3216, 4},
       {[](uint8_t* b) { return MISC_write_RamdumpEnable(b); }, 0, true, 3216, 4},
@@ -157,11 +142,27 @@ TEST(MiscStore, ItemAccess) {
       // Without a partition a length beyond the item is an open failure, not a length error.
       {[](uint8_t* b) { return mfg_emmc_write(2, b, 25); }, -5, true, 0, 0,
        kOpenFailed + "Error: open partition failed, item=2.\n", false},
+      {[](uint8_t* b) {
+         return MISC_write_RamdumpEnable(b) + unlink(MISC_PATH_PRIMARY) +
+                MISC_read_RamdumpEnable(b);
+       },
+       -5, true, 0, 0,
+       std::string("Error: ") + MISC_PATH_PRIMARY +
+           " open failed.\nError: open partition failed, item=3\n",
+       true, true},
+      {[](uint8_t* b) {
+         uint8_t flag[4];
+         return MISC_read_RamdumpEnable(flag) + close(creat(MISC_PATH_PRIMARY, 0644)) +
+                MISC_write_RamdumpEnable(b);
+       },
+       0, true, 3216, 4},
   };
   for (size_t k = 0; k < sizeof(cases) / sizeof(cases[0]); ++k) {
     const auto& c = cases[k];
     write_host_file(device.misc_host_path(), image);
     if (!c.partition) device.remove(MISC_DEVICE);
+    device.remove(MISC_PATH_PRIMARY);
+    if (c.primary) device.write_file(MISC_PATH_PRIMARY, image);
     std::string buffer(32, '\xEE');
     for (size_t i = 0; c.write && i < buffer.size(); ++i) buffer[i] = static_cast<char>(i + 1);
     RunResult r = device.run_in_root([&] {
@@ -186,32 +187,6 @@ TEST(MiscStore, ItemAccess) {
           << "row " << k;
     }
   }
-}
-
-// The path is settled at the first access of a process: the primary one if it opens then (and
-// no fallback afterwards), else the secondary one for good.
-TEST(MiscStore, PathChoiceLastsForTheProcess) {
-  FakeDevice device;
-  REQUIRE_DEVICE(device);
-  const std::string blank = device.misc_bytes();
-  device.write_file(MISC_PATH_PRIMARY, blank);
-  RunResult r = device.run_in_root([&] {
-    uint8_t flag[4] = {'E', 'n', 'A', 'b'};
-    if (MISC_write_RamdumpEnable(flag) != 0 || unlink(MISC_PATH_PRIMARY) != 0) return 1;
-    return MISC_read_RamdumpEnable(flag) == -5 ? 0 : 2;
-  });
-  EXPECT_EQ(r.status, 0);
-  EXPECT_EQ(r.out, std::string("Error: ") + MISC_PATH_PRIMARY +
-                       " open failed.\nError: open partition failed, item=3\n");
-
-  r = device.run_in_root([&] {
-    uint8_t flag[4] = {'D', 'i', 'S', 'a'}, back[4] = {};
-    if (MISC_write_RamdumpEnable(flag) != 0 || fopen(MISC_PATH_PRIMARY, "w") == nullptr) return 1;
-    return MISC_read_RamdumpEnable(back) == 0 && memcmp(back, flag, 4) == 0 ? 0 : 2;
-  });
-  EXPECT_EQ(r.status, 0);
-  EXPECT_EQ(r.out, "");
-  EXPECT_EQ(device.misc_bytes(), patched(blank, 3216, "DiSa"));
 }
 
 }  // namespace
