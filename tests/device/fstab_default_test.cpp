@@ -88,6 +88,7 @@ void write_dt_entry(FakeDevice& d, const std::string& name, const std::string& s
 TEST(DefaultFstab, DeviceTreeTableMergedFirst) {
   FakeDeviceConfig config;
   config.cmdline = "androidboot.android_dt_dir=/dt androidboot.slot=a\n";
+  config.fstab += "/dev/block/cache /cache ext4 rw wait,verify=/dev/x\n";
   FakeDevice device(config);
   REQUIRE_DEVICE(device);
   device.set_property("ro.boot.hardware", "rbtest");
@@ -101,7 +102,7 @@ TEST(DefaultFstab, DeviceTreeTableMergedFirst) {
   device.write_file("/dt/fstab/plain", "x");
 
   RunResult r;
-  EXPECT_EQ(dump_default(device, &r), "3 NULL");
+  EXPECT_EQ(dump_default(device, &r), "4 NULL");
   std::string log;
   int k = 0;  // device-tree records in directory order (the file system's), then the file's
   for (const auto& entry : std::filesystem::directory_iterator(device.host_path("/dt/fstab"))) {
@@ -116,17 +117,18 @@ TEST(DefaultFstab, DeviceTreeTableMergedFirst) {
     }
   }
   EXPECT_EQ(field(r.out, "rec[2].mount_point"), "\"/data\"");
+  EXPECT_EQ(field(r.out, "rec[3].mount_point"), "\"/cache\"");
   EXPECT_EQ(device.log(), log);
 
   // One incomplete entry discards the whole device-tree table, as does a longer compatible.
   device.remove("/dt/fstab/vendor/fsmgr_flags");
-  EXPECT_EQ(dump_default(device), "1 \"/vendor/etc/fstab.rbtest\"");
+  EXPECT_EQ(dump_default(device), "2 \"/vendor/etc/fstab.rbtest\"");
   EXPECT_TRUE(
       contains(device.log(),
                "E fstab_dump: [libfs_mgr]dt_fstab: Failed to find type for partition vendor\n"));
   write_dt_entry(device, "vendor", "ok", "wait");
   device.write_file("/dt/fstab/compatible", dt("android,fstab,extra"));
-  EXPECT_EQ(dump_default(device), "1 \"/vendor/etc/fstab.rbtest\"");
+  EXPECT_EQ(dump_default(device), "2 \"/vendor/etc/fstab.rbtest\"");
   EXPECT_TRUE(contains(device.log(), kNoDt));
 
   // The hardware name from the device tree, then from nowhere.
@@ -155,9 +157,10 @@ TEST(BootConfig, CommandLineDeviceTreeAndSlot) {
   device.write_file("/dt/compatible", dt("android,firmware"));
   device.write_file("/dt/dtkey", dt("v"));
   device.write_file("/dt/one", dt(""));
+  device.write_file("/dt/zero", "");  // not even the NUL byte
   RunResult r = device.run_in_root([] {
-    for (const char* key : {"hardware", "mode", "empty", "bare", "prop", "dtkey", "one", "serial",
-                            "last", "missing"}) {
+    for (const char* key : {"hardware", "mode", "empty", "bare", "prop", "dtkey", "one", "zero",
+                            "serial", "last", "missing"}) {
       std::string value = "unchanged";
       bool found = fs_mgr_get_boot_config(key, &value);
       printf("%s=%d:%s\n", key, found, found ? value.c_str() : "");
@@ -171,13 +174,17 @@ TEST(BootConfig, CommandLineDeviceTreeAndSlot) {
       std::ofstream("/dt/compatible") << compatible;
       printf("compatible=%d\n", is_dt_compatible());
     }
+    value = "unchanged";  // without a kernel command line to read
+    if (chroot("/tmp") != 0) return 1;
+    printf("no cmdline=%d:%s\n", fs_mgr_get_boot_config_from_kernel_cmdline("last", &value),
+           value.c_str());
     return 0;
   });
   EXPECT_EQ(r.status, 0) << r.err;
   EXPECT_EQ(r.out,
-            "hardware=1:abc\nmode=0:\nempty=1:\nbare=0:\nprop=1:pv\ndtkey=1:v\none=1:\n"
+            "hardware=1:abc\nmode=0:\nempty=1:\nbare=0:\nprop=1:pv\ndtkey=1:v\none=1:\nzero=0:\n"
             "serial=1:\"x\nlast=1:z\nmissing=0:\ncmdline prop=0:unchanged\ndir=/dt\n"
-            "compatible=0\ncompatible=0\n");
+            "compatible=0\ncompatible=0\nno cmdline=0:unchanged\n");
 }
 
 // fstab_dump --find: the tool's lookup in the default table. Only an encryptable record on a
