@@ -90,8 +90,8 @@ void check_layout(void (*encode)(const T&, uint8_t*), T (*decode)(const uint8_t*
 TEST(ChainRecords, ByteLayout) {
   using namespace std::string_literals;
   check_layout(encode_chain_block_header, decode_chain_block_header,
-               {CHAIN_BLOCK_MAGIC, 0x11223344, 0, 0x0400, 0xA1B2C3D4},
-               "BCho\x44\x33\x22\x11\0\0\0\x04\xD4\xC3\xB2\xA1"s);
+               {CHAIN_BLOCK_MAGIC, 0x11223344, 0x5566, 0x0400, 0xA1B2C3D4},
+               "BCho\x44\x33\x22\x11\x66\x55\0\x04\xD4\xC3\xB2\xA1"s);
   check_layout(encode_initial_block_header, decode_initial_block_header,
                {INITIAL_BLOCK_HEADER_MAGIC, 0x00012345, 4096, 0x10800, 0xCAFEF00D, STATE_ARMED},
                "BHdr\x45\x23\x01\0\0\x10\0\0\0\x08\x01\0\x0D\xF0\xFE\xCA\x01\0\0\0"s);
