@@ -262,8 +262,10 @@ TEST_F(Fstab, BlockDeviceLookup) {
     EXPECT_STREQ(find_block_device(path, t, &encryptable, &encrypted), want) << path;
   }
   release(t);
-  fstab empty = {0, nullptr, nullptr};
-  EXPECT_EQ(find_block_device("/data", &empty, &encryptable, &encrypted), nullptr);
+  t = parse("/dev/data /data ext4 rw wait\n");
+  EXPECT_STREQ(find_block_device("/data/x", t, &encryptable, &encrypted), "/dev/data");
+  release(t);
+  EXPECT_EQ(find_block_device("/data", nullptr, &encryptable, &encrypted), nullptr);
 }
 
 // Logging a failure leaves the caller's errno as the failure set it.
