@@ -1,7 +1,7 @@
 // ramdump_inspect's model of the tool's message extraction against the real one. Byte 0 bit 0
-// pads the last unit to a whole one, bytes 1 and 2 are left for other uses, the rest is a dump
-// stream. Cut into units, the model must say RAMDUMP_MSG.txt comes out complete exactly when
-// the real extraction writes a file of the size its last "Found file" line announced.
+// pads the last unit to a whole one, bytes 1 and 2 are unused, the rest is a dump stream. Cut into
+// units, the model must say RAMDUMP_MSG.txt comes out complete exactly when the real extraction
+// writes a file of the size its last "Found file" line announced.
 #include <sys/stat.h>
 
 #include <string>
