@@ -1,6 +1,5 @@
-// The boot-time entry (-a, "enable full") and the automatic cycle, run as the real binary in
-// the fake device root: request file, properties, space thresholds, the state word, and one
-// full-size crash cycle with the firmware simulator.
+// The boot-time entry (-a, "enable full") and the automatic cycle, as the real binary in the
+// fake device root, with the firmware simulator storing the dumps.
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
@@ -45,8 +44,8 @@ TEST(BootEntry, RequestFileAndEnableFull) {
   REQUIRE_DEVICE(device);
   device.write_file("/data/vendor/ramdump/kvdump.rdmp", "old");
 
-  // A missing request file is created empty for everyone; disabled, everything of the feature
-  // is deleted, and the missing reserved file makes the result.
+  // Disabled with no request file: the file is created empty for everyone, the feature's
+  // files deleted; the missing reserved file makes the result.
   set_misc_item(device, 3216, "DiSa");
   RunResult r = device.run({"-a"});
   EXPECT_EQ(r.status, 255);
@@ -59,8 +58,7 @@ TEST(BootEntry, RequestFileAndEnableFull) {
                                              std::string(kReserved) +
                                              ": No such file or directory\\n\n"));
 
-  // "disable" on the first line wins over a later "enable"; the reserved file and the outputs
-  // go, and deleting the reserved file is the result.
+  // "disable" on the first line wins over a later "enable".
   set_misc_item(device, 3216, "EnAb");
   set_misc_item(device, 3184, std::string(24, '\x33'));
   device.write_file(kStatus, "disable\nenable\n", 0666);
@@ -75,8 +73,7 @@ TEST(BootEntry, RequestFileAndEnableFull) {
     EXPECT_FALSE(device.exists(gone)) << gone;
   }
 
-  // "enabled" begins with "enable"; a present reserved file with nothing stored keeps the
-  // cycle short: "No ramdump found".
+  // "enabled" begins with "enable"; nothing stored: "No ramdump found".
   device.write_file(kReserved, std::string(8 * 4096, '\xFF'));
   set_misc_item(device, 3216, "DiSa");
   device.write_file(kStatus, "enabled", 0666);
@@ -87,9 +84,8 @@ TEST(BootEntry, RequestFileAndEnableFull) {
   EXPECT_TRUE(contains(tool_log(device), kNoDump)) << device.log();
   EXPECT_EQ(device.property("debug.kvo.kvdump"), "fail");
 
-  // "enable full" enables and runs the cycle, leaves the block address item and the request
-  // file alone, and exits 0 whatever the cycle did; anything else is an ordinary command line
-  // with "enable" as its (missing) block file.
+  // "enable full" enables, runs the cycle, leaves the block address item alone and exits 0;
+  // anything else is a conversion of the missing file "enable".
   device.write_file(kStatus, "disable", 0666);
   set_misc_item(device, 3136, "LBA!");
   for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
@@ -154,9 +150,8 @@ TEST(AutoCycle, SpaceThresholdsAndUnusableReservedFile) {
   }
 }
 
-// The state word is stored armed and without a dump, other bits kept; the dump bit of the old
-// value decides whether there is a dump, and the re-arming after a read-out stores a fresh
-// header (state 1). A small reserved file keeps it fast.
+// The dump bit of the stored state decides; the state is stored armed without a dump, other
+// bits kept, and a re-arming after a read-out stores a fresh header (state 1).
 TEST(AutoCycle, StateWordAndReadOutOfASmallChain) {
   FakeDevice device(16 * kGiB);
   REQUIRE_DEVICE(device);
@@ -185,7 +180,6 @@ TEST(AutoCycle, StateWordAndReadOutOfASmallChain) {
     EXPECT_EQ(verify_chain(device, blocks, 0xfeed, true), "");  // re-armed with the stored CRC
     EXPECT_EQ(contains(tool_log(device), kNoDump), !c.dump) << device.log();
     if (!c.dump) continue;
-    // Only the message file is extracted (its record follows another one in the stream).
     EXPECT_EQ(std::filesystem::file_size(device.host_path(kOutput)), count * 4096u);
     EXPECT_EQ(device.read_file(kMessage), files[1].second);
     EXPECT_FALSE(device.exists(std::string(kOutDir) + "/firmware_log.bin"));
@@ -195,9 +189,8 @@ TEST(AutoCycle, StateWordAndReadOutOfASmallChain) {
   }
 }
 
-// One crash cycle at full size: the first boot creates and arms the 4224 MiB reserved file
-// (with exactly 10 GiB free), the simulated firmware stores a dump, the second boot reads it
-// out, extracts the message and re-arms, the third boot finds nothing.
+// Full size: the first boot creates and arms 4224 MiB with exactly 10 GiB free, the firmware
+// stores a dump, the second boot collects and re-arms, the third finds nothing.
 TEST(AutoCycle, FullCrashCycleAtFullSize) {
   FakeDevice device(16 * kGiB);
   REQUIRE_DEVICE(device);
@@ -225,8 +218,7 @@ TEST(AutoCycle, FullCrashCycleAtFullSize) {
                        {"/tmp/memory0.bin", big}};
   simulate_crash(device, files);
   EXPECT_EQ(stored_ibh(device), make_ibh(blocks[0], 4096, kCount, 0x1234abcd, 3));
-  // The chain blocks as the firmware left them, for the output of the read-out.
-  std::vector<size_t> stored;
+  std::vector<size_t> stored;  // hashes of the blocks as the firmware left them
   std::ifstream raw(device.data_device(), std::ios::binary);
   std::string block(4096, '\0');
   for (long b : blocks) {
@@ -242,7 +234,6 @@ TEST(AutoCycle, FullCrashCycleAtFullSize) {
   EXPECT_EQ(stored_ibh(device), make_ibh(blocks[0], 4096, kCount, 0x1234abcd, 1));
   EXPECT_EQ(verify_chain(device, blocks, 0x1234abcd, false), "");
 
-  // The output is every chain block in chain order as the firmware left it.
   ASSERT_EQ(std::filesystem::file_size(device.host_path(kOutput)), 4429185024u);
   std::ifstream out(device.host_path(kOutput), std::ios::binary);
   size_t first_bad = kCount;

@@ -1,8 +1,7 @@
-// A throw-away Android-like root for running the real binaries at the fixed paths they use:
-// a tmpfs with /usr bound read-only, /proc with a fixture /proc/cmdline, a zeroed 1 MiB misc
-// partition image at MISC_DEVICE, the property directory, the programs in /system/bin, and
-// optionally /data as ext4 on a self-detaching loop device. The process is in a private mount
-// namespace (device_test_main.cpp), so every mount vanishes with it even if it is killed.
+// A throw-away Android-like root for the real binaries: a tmpfs with /usr bound read-only, /proc
+// with a fixture /proc/cmdline, a zeroed 1 MiB misc image, the property directory, the programs
+// in /system/bin, and optionally /data as ext4 on a self-detaching loop device. Its mounts live
+// in the process's private mount namespace and vanish with it.
 #pragma once
 
 #include <stdint.h>
@@ -15,11 +14,9 @@
 #define USERDATA_DEVICE "/dev/block/bootdevice/by-name/userdata"
 #define MISC_DEVICE "/dev/block/bootdevice/by-name/misc"
 
-// Whole host files ("" when absent).
-std::string read_host_file(const std::string& path);
+std::string read_host_file(const std::string& path);  // "" when absent
 void write_host_file(const std::string& path, const std::string& content);
 
-// The little-endian 32-bit word at offset.
 uint32_t le32_at(const std::string& bytes, size_t offset);
 
 inline bool contains(const std::string& text, const std::string& part) {
@@ -27,7 +24,6 @@ inline bool contains(const std::string& text, const std::string& part) {
 }
 
 struct FakeDeviceConfig {
-  // Implicit, so that FakeDevice device(64u << 20) has a 64 MiB /data.
   FakeDeviceConfig(uint64_t data_bytes = 0) : data_bytes(data_bytes) {}
   std::string cmdline = "console=ttyS0 androidboot.hardware=rbtest\n";
   uint64_t data_bytes;       // nonzero: /data is a (sparse) ext4 image of this size
@@ -40,8 +36,8 @@ struct RunResult {
   std::string out, err;
   int status = -1;  // exit status, or 128 + signal number
   bool timed_out = false;
-  double seconds = 0;   // wall time
-  long max_rss_kb = 0;  // peak resident memory
+  double seconds = 0;  // wall time
+  long max_rss_kb = 0;
 };
 
 class FakeDevice {
@@ -51,10 +47,8 @@ class FakeDevice {
   FakeDevice(const FakeDevice&) = delete;
   FakeDevice& operator=(const FakeDevice&) = delete;
 
-  // Empty when the root was set up; otherwise what went wrong.
   const std::string& setup_error() const { return error_; }
 
-  // Files of the root, by their path inside it.
   std::string host_path(const std::string& device_path) const { return root_ + device_path; }
   void write_file(const std::string& device_path, const std::string& content, mode_t mode = 0644);
   std::string read_file(const std::string& path) const { return read_host_file(host_path(path)); }
@@ -67,8 +61,7 @@ class FakeDevice {
   std::string property(const std::string& name) const {  // absent reads as ""
     return read_file("/dev/__properties__/" + name);
   }
-  // The system log, one record per line (platform/log.h). The root has the log file, as a
-  // phone has its log daemon; the programs only append to it.
+  // The system log (platform/log.h), one record per line: the programs only append to it.
   std::string log() const { return read_file("/dev/__log__"); }
   void clear_log() { write_file("/dev/__log__", "", 0666); }
 
@@ -78,7 +71,7 @@ class FakeDevice {
                 int timeout_seconds = 600);
   // Runs fn in a child chrooted into the root; its result is the exit status.
   RunResult run_in_root(const std::function<int()>& fn, int timeout_seconds = 60);
-  // Gets each line that a run writes to standard error while it runs; empty: off.
+  // Gets each line a run writes to standard error while it runs.
   void set_stderr_listener(std::function<void(const std::string&)> listener) {
     stderr_listener_ = std::move(listener);
   }
@@ -86,13 +79,12 @@ class FakeDevice {
   std::string misc_host_path() const { return host_path(MISC_DEVICE); }
   std::string misc_bytes() const { return read_file(MISC_DEVICE); }
 
-  // The raw /data device (host node) and reads and writes through it.
+  // The raw /data device (host node).
   const std::string& data_device() const { return loop_device_; }
   std::string read_raw(uint64_t offset, size_t length) const;
   void write_raw(uint64_t offset, const std::string& bytes) const;
 
-  // Fills /data (files under /data/filler) until statvfs reports exactly this many available
-  // bytes; false if it cannot.
+  // Fills /data/filler until exactly this many bytes are available; false if it cannot.
   bool set_free_space(uint64_t bytes);
   uint64_t free_space() const;
 
@@ -107,11 +99,9 @@ class FakeDevice {
   std::function<void(const std::string&)> stderr_listener_;
 };
 
-// Whether the harness can run here (root), and why not.
 bool fake_device_supported(std::string* why);
 
-// Moves the process into a private mount namespace, so that the mounts of its fake devices
-// never reach the host and vanish with it. False, after perror(who), when that fails.
+// So that the fake devices' mounts never reach the host. False, after perror(who), on failure.
 bool enter_private_mount_namespace(const char* who);
 
 // In a test: skips when the harness cannot run here, fails when the root was not set up.
