@@ -55,7 +55,7 @@ struct Chain {
     write_host_file(misc, image.replace(offset, bytes.size(), bytes));
   }
   // Changes the header of chain block i; with fix, its CRC follows the change.
-  void patch(size_t i, const std::function<void(chain_block_header&)>& change, bool fix) {
+  void patch(size_t i, const std::function<void(chain_block_header&)>& change, bool fix = false) {
     std::string image = read_host_file(dev);
     auto at = [&](size_t k) { return reinterpret_cast<uint8_t*>(&image[blocks[k] * 4096]); };
     chain_block_header h = decode_chain_block_header(at(i));
@@ -77,16 +77,10 @@ TEST(Inspect, VerifyMiscAndFirmwareSim) {
   Chain c;
   const std::string dev = c.dev, misc = c.misc, dev_image = read_host_file(dev),
                     misc_image = read_host_file(misc);
-  auto header = [&](size_t i, auto change, bool fix = false) {
-    return [=, &c] { c.patch(i, change, fix); };
-  };
-  auto stored = [&](uint32_t count, uint32_t crc) {
-    return [=, &c] { c.set_misc(3184, make_ibh(100, 4096, count, crc, 1)); };
-  };
   auto items = [&](std::string flag, std::string ibh, std::string lba) {
     return [=, &c] { c.set_misc(3216, flag), c.set_misc(3184, ibh), c.set_misc(3136, lba); };
   };
-  auto crc = [](auto& h) { h.crc ^= 1; };
+  auto crc = [](chain_block_header& h) { h.crc ^= 1; };
   const std::string verify = "ramdump_inspect verify ", out = " " + c.out,
                     on_device = verify + "--device " + dev + " --misc " + misc,
                     stores = verify + "--misc " + misc + out,
@@ -99,37 +93,41 @@ TEST(Inspect, VerifyMiscAndFirmwareSim) {
     std::vector<std::string> expected;
   } rows[] = {
       // clang-format off
-      {nullptr, verify + out, 0, {"blocks: 1505\nruns: 5, longest 1024\nrun lengths: 1: 2, 2-3: 1, 256-511: 1, 1024: 1\n"
-       "chain block 0: CRC not checked", "result: good\n"}},
-      {nullptr, stores, 0, {"blocks: 1505\n", "result: good\n"}},
+      {nullptr, verify + out, 0, {"blocks: 1505\nruns: 5, longest 1024\n"
+       "run lengths: 1: 2, 2-3: 1, 256-511: 1, 1024: 1\nchain block 0: CRC not checked", "result: good\n"}},
       {nullptr, verify + "--first-block 0100 --initial-crc 5eed1234" + out, 0, {"result: good\n"}},
       {nullptr, verify + "--first-block 0x65 --initial-crc 5eed1234" + out, 1,
        {"first bad block: chain block 0 (block 101): bad CRC"}},
-      {stored(1505, 7), stores, 1, {"chain block 0 (block 100): bad CRC"}},
-      {header(500, crc), verify + "--json" + out, 1, {"\"blocks\": 1505, \"runs\": 5, \"longest_run\": 1024, \"run_lengths\": "
-       "{\"1\": 2, \"2-3\": 1, \"256-511\": 1, \"1024\": 1}, \"block0_checked\": false, \"ok\": false, \"first_bad\": "
-       "{\"chain_block\": 500, \"block\": 600, \"reason\": \"bad CRC"}},
-      {header(1502, [](auto& h) { h.magic = 0; }), verify + out, 1, {"chain block 1502 (block 1701): bad magic 00000000"}},
-      {header(700, [](auto& h) { ++h.run_remaining; }), verify + out, 1,
+      {[&] { c.set_misc(3184, make_ibh(100, 4096, 1505, 7, 1)); }, stores, 1,
+       {"chain block 0 (block 100): bad CRC"}},
+      {[&] { c.patch(500, crc); }, verify + "--json" + out, 1, {"\"blocks\": 1505, \"runs\": 5, \"longest_run\": 1024, "
+       "\"run_lengths\": {\"1\": 2, \"2-3\": 1, \"256-511\": 1, \"1024\": 1}, \"block0_checked\": false, \"ok\": false, "
+       "\"first_bad\": {\"chain_block\": 500, \"block\": 600, \"reason\": \"bad CRC"}},
+      {[&] { c.patch(1502, [](auto& h) { h.magic = 0; }); }, verify + out, 1,
+       {"chain block 1502 (block 1701): bad magic 00000000"}},
+      {[&] { c.patch(700, [](auto& h) { ++h.run_remaining; }); }, verify + out, 1,
        {"chain block 700 (block 800): run_remaining 325 inside a run, expected 324"}},
-      {header(1500, [](auto& h) { h.run_remaining = 2; }), verify + out, 1,
+      {[&] { c.patch(1500, [](auto& h) { h.run_remaining = 2; }); }, verify + out, 1,
        {"chain block 1500 (block 2500): run_remaining 2, but next_block 1700 is not block 2500 + 1"}},
-      {header(1504, [](auto& h) { h.next_block = 77; }, true), verify + out, 1,
+      {[&] { c.patch(1504, [](auto& h) { h.next_block = 77; }, true); }, verify + out, 1,
        {"chain block 1504 (block 3000): the chain does not end: next_block 77"}},
-      {header(1023, [](auto& h) { h.next_block = 0; }, true), verify + out, 1,
+      {[&] { c.patch(1023, [](auto& h) { h.next_block = 0; }, true); }, verify + out, 1,
        {"chain block 1023 (block 1123): next_block 0 ends the chain, but more"}},
-      {stored(1506, kCrc), stores, 1, {"1505 blocks, but the stored header counts 1506"}},
+      {[&] { c.set_misc(3184, make_ibh(100, 4096, 1506, kCrc, 1)); }, stores, 1,
+       {"1505 blocks, but the stored header counts 1506"}},
       {nullptr, on_device, 0, {"device: ", "blocks: 1505\n", "result: good\n"}},
-      {header(1200, crc), on_device, 1, {"blocks: 1200\n", "chain block 1200 (block 1300): bad CRC"}},
-      {header(1504, [](auto& h) { h.next_block = 1700; }, true), on_device, 1,
+      {[&] { c.patch(1200, crc); }, on_device, 1, {"blocks: 1200\n", "chain block 1200 (block 1300): bad CRC"}},
+      {[&] { c.patch(1504, [](auto& h) { h.next_block = 1700; }, true); }, on_device, 1,
        {"chain goes on past its 1505 blocks (to block 1700)"}},
-      {stored(1506, kCrc), on_device, 1, {"chain ends after 1505 of 1506 blocks"}},
-      {items("", "BHdx" + make_ibh(1, 2, 3, 4, 0).substr(4), ""), on_device, 1, {"its magic is not \"BHdr\": it names no chain"}},
+      {[&] { c.set_misc(3184, make_ibh(100, 4096, 1506, kCrc, 1)); }, on_device, 1,
+       {"chain ends after 1505 of 1506 blocks"}},
+      {items("", "BHdx" + make_ibh(1, 2, 3, 4, 0).substr(4), ""), on_device, 1,
+       {"its magic is not \"BHdr\": it names no chain"}},
       {items("DiSa", std::string(24, '\0'), "\xff\xff\xff\xff"), misc_text, 0, {"\"DiSa\": disabled\n",
-       "24 zero bytes: the disabled form, it names no chain", "block address (offset 3136): ffffffff: the disable value",
+       "24 zero bytes: the disabled form, it names no chain", "block address (offset 3136): ffffffff: the disable",
        "unused item (offset 3160, left alone by the tool): 00 00 00 00\n"}},
       {state, misc_text, 0, {": enabled\n", "first block  4660\n", "initial CRC  00000abc\n",
-       "state        00000013: armed, dump present, other bits 00000010\n", "00000010: a block address, not the disable"}},
+       "state        00000013: armed, dump present, other bits 00000010\n", "00000010: a block address, not"}},
       {state, "ramdump_inspect misc --json " + misc, 0, {"\"names_chain\": true, \"no_chain_reason\": null,",
        "\"state\": 19, \"state_bits\": [\"armed\",\"dump present\",\"other bits 00000010\"]},\n"}},
       {[&] { write_host_file(misc, read_host_file(misc).substr(0, 3219)); }, misc_text, 1,
