@@ -91,6 +91,7 @@ class InspectStream : public testing::Test {
 // real one.
 TEST_F(InspectStream, StreamsAndEndings) {
   __android_log_set_logger([](const __android_logger_data*, const char*) {});
+  umask(022);
   struct Row {
     std::vector<Rec> recs;
     std::string readout, err;  // readout: "" for the records' own; err: in list's error or detail
@@ -148,6 +149,7 @@ TEST_F(InspectStream, StreamsAndEndings) {
 
     fs::remove_all(x_);
     EXPECT_EQ(inspect("extract " + readout_ + " " + x_).status, row.status);
+    EXPECT_EQ(fs::status(x_).permissions(), fs::perms(0755));  // made under the umask 022
     Files want;
     for (const Rec& r : row.recs) want[want.count(r.name) ? r.name + ".1" : r.name] = r.content;
     EXPECT_EQ(files(x_), want);
@@ -204,6 +206,7 @@ TEST_F(InspectStream, CommandsNamesAndTargets) {
       {' ', "extract " + r + " " + d + "/no/x", "/no/x: cannot be created", 1},
       {' ', "strip " + r + " " + r, "is the read-out itself\n", 1},
       {' ', "strip " + r + " " + d + "/fifo", "a FIFO without a reader\n", 1},
+      {' ', "strip " + r + " /dev/full", "/dev/full: write failed: No space left on device\n", 1},
       {' ', "strip " + r + " " + x_ + "/stream", "", 0, {"x/stream: 4080 bytes of dump stream from 1 units\n"},
        {{"stream", readout.substr(16)}}},
       {' ', "list " + d + "/fifo", "", 0, {"no records"}},
