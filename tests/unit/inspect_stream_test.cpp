@@ -40,7 +40,7 @@ std::string stream_of(const std::vector<Rec>& recs) {
 }
 
 // The records part of list --json: offsets from the layout, a record incomplete when its
-// content falls short of its size.
+// content falls short of its size, a name noted when it repeats.
 std::string records_json(const std::vector<Rec>& recs) {
   std::string out, names = "/";
   uint64_t offset = 0;
@@ -82,7 +82,7 @@ class InspectStream : public testing::Test {
     return out;
   }
 
-  std::string dir_ = testing::TempDir() + "inspect_stream_XXXXXX";
+  std::string dir_ = testing::TempDir() + "readout_XXXXXX";
   const std::string readout_ = (mkdtemp(dir_.data()), dir_ + "/RAMDUMP_OUTPUT"), x_ = dir_ + "/x";
 };
 
