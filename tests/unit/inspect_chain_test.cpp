@@ -75,17 +75,16 @@ struct Chain {
 // damaged in one place each; none of them changes either image.
 TEST(Inspect, VerifyMiscAndFirmwareSim) {
   Chain c;
-  const std::string dev = c.dev, misc = c.misc, dev_image = read_host_file(dev),
-                    misc_image = read_host_file(misc);
+  // clang-format off
+  const std::string dev = c.dev, misc = c.misc, dev_image = read_host_file(dev), misc_image = read_host_file(misc);
   auto items = [&](std::string flag, std::string ibh, std::string lba) {
     return [=, &c] { c.set_misc(3216, flag), c.set_misc(3184, ibh), c.set_misc(3136, lba); };
   };
   auto crc = [](chain_block_header& h) { h.crc ^= 1; };
-  const std::string verify = "ramdump_inspect verify ", out = " " + c.out,
-                    on_device = verify + "--device " + dev + " --misc " + misc,
-                    stores = verify + "--misc " + misc + out,
-                    misc_text = "ramdump_inspect misc " + misc;
+  const std::string verify = "ramdump_inspect verify ", out = " " + c.out, misc_text = "ramdump_inspect misc " + misc,
+                    on_device = verify + "--device " + dev + " --misc " + misc, stores = verify + "--misc " + misc + out;
   const auto state = items("disa", make_ibh(0x1234, 4096, 99, 0xabc, 0x13), "\x10\0\0\0");
+  // clang-format on
   struct {
     std::function<void()> damage;
     std::string command;

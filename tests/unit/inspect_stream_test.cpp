@@ -108,13 +108,10 @@ TEST_F(InspectStream, StreamsAndEndings) {
   for (size_t d : {0, 2, 16, 17, 39, 40, 45})
     rows.push_back({{{"memory0.bin", pattern(P - d - 40, 1)}, {"RAMDUMP_MSG.txt", msg}}, "", "",
                     P - d + 40 + msg.size(), "bad_magic", 0, d < 17 || d > 39});
-  // clang-format on
-  std::string bad_chain =
-      readout_units(stream_of({{"memory0.bin", pattern(P - 40, 7), 6000}}) + pattern(1960, 7));
+  std::string bad_chain = readout_units(stream_of({{"memory0.bin", pattern(P - 40, 7), 6000}}) + pattern(1960, 7));
   bad_chain[4096] = 'X';  // chain block magic of unit 1
-  const std::string head = stream_of({{"memory0.bin", pattern(P - 60, 8)}}) +
-                           dump_record("kernel_log.bin", 9, "").substr(0, 20);
-  // clang-format off
+  const std::string head =
+      stream_of({{"memory0.bin", pattern(P - 60, 8)}}) + dump_record("kernel_log.bin", 9, "").substr(0, 20);
   rows.insert(rows.end(), {
       // 20 bytes before a unit's end, "F1Le" in a name where the tool takes the magic from.
       {{{"memory0.bin", pattern(P - 60, 1)}, {"kernel_log01F1Le", "k"}, {"RAMDUMP_MSG.txt", msg}}, "", "",
@@ -170,27 +167,24 @@ TEST_F(InspectStream, CommandsNamesAndTargets) {
   const std::string readout =
       readout_units(stream_of({{"memory0.bin", "new"}, {"RAMDUMP_OUTPUT", "log"}}));
   write_host_file(readout_, readout);
-  const std::string &r = readout_, &d = dir_, names = d + "/names", split = d + "/split",
-                    real = d + "/real", outside = d + "/outside";
   // clang-format off
+  const std::string &r = readout_, &d = dir_, names = d + "/names", split = d + "/split", real = d + "/real",
+                    outside = d + "/outside";
   const std::pair<std::string, std::string> unsafe[] = {  // record name, file name
       {"kernel_log.bin", "kernel_log.bin"}, {"kernel_log.bin", "kernel_log.bin.1"}, {"../../escape", ".._.._escape"},
       {"..", "record_123"}, {"", "record_164"}, {"ttyS0\x01log", "ttyS0_log"},
       {"abcdefghijklmnopqrstuvw", "abcdefghijklmnopqrst_"}, {"kernel_log.bin.1", "kernel_log.bin.1.1"}, {"/", "_"}};
-  // clang-format on
   std::vector<Rec> recs;
   Files safe;
   for (const auto& [name, file] : unsafe)
     recs.push_back({name, std::string(1, 'a' + recs.size())}), safe[file] = recs.back().content;
   write_host_file(names, readout_units(stream_of(recs)));
-  write_host_file(
-      split,
-      readout_units(stream_of({{"memory0.bin", pattern(P - 57, 1)}, {"RAMDUMP_MSG.txt", "m"}})));
+  write_host_file(split, readout_units(stream_of({{"memory0.bin", pattern(P - 57, 1)}, {"RAMDUMP_MSG.txt", "m"}})));
   ASSERT_EQ(mkfifo((d + "/fifo").c_str(), 0600), 0);
   write_host_file(outside, "keep");
   const Files log = {{"RAMDUMP_OUTPUT", "log"}}, old = {{"memory0.bin", "old"}, *log.begin()},
-              both = {{"memory0.bin", "new"}, *log.begin()},
-              link = {{"memory0.bin", "keep"}, *log.begin()};
+              both = {{"memory0.bin", "new"}, *log.begin()}, link = {{"memory0.bin", "keep"}, *log.begin()};
+  // clang-format on
   struct {
     char before;  // in x/memory0.bin: f a file, l a link to outside; d: x is a link to real
     std::string args, err;
