@@ -27,7 +27,9 @@ RunResult run(const std::string& command) {
   const int w = system((std::string(wrapper != nullptr ? wrapper : "") + " " RB_BUILD_DIR "/" +
                         command + " >" + out + " 2>&1")
                            .c_str());
-  return {read_host_file(out), "", WIFEXITED(w) ? WEXITSTATUS(w) : -1};
+  RunResult r = {read_host_file(out), "", WIFEXITED(w) ? WEXITSTATUS(w) : -1};
+  unlink(out.c_str());
+  return r;
 }
 
 // Blocks in two runs of 1024 and 476, then three short ones, armed into a sparse device image,
