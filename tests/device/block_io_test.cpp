@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <string>
 #include <vector>
 
@@ -35,8 +36,7 @@ std::string header_lines(uint32_t first, uint32_t count, uint32_t crc) {
 TEST(Arming, CreatedContiguousFile) {
   FakeDevice device(256ull << 20);
   REQUIRE_DEVICE(device);
-  // 20000 blocks created by the tool: runs longer than 1024 blocks, creation progress every
-  // 256 chunks of 64 KiB and arming progress every 8192 blocks.
+  // Runs longer than 1024 blocks; progress every 256 chunks of 64 KiB and every 8192 blocks.
   const std::string big = kDir + "big";
   RunResult r = device.run({"-p", "-i", "12345678", "-c", "81920000", big});
   ASSERT_EQ(r.status, 0) << device.log();
@@ -47,34 +47,31 @@ TEST(Arming, CreatedContiguousFile) {
             "0/1250\n256/1250\n512/1250\n768/1250\n1024/1250\n1250/1250\n"
             "0/20000\n8192/20000\n16384/20000\n20000/20000\n");
   EXPECT_EQ(verify_chain(device, blocks, 0x12345678, true), "");
-  const std::string info = "\\n\nI reserveblocks: ";
-  EXPECT_EQ(tool_log(device), "I reserveblocks: Creating reserved area 81920000 bytes" + info +
-                                  "  block dev: " USERDATA_DEVICE + info + "encryptable: yes" +
-                                  info + "  encrypted: no" + info + "initial CRC: 12345678" + info +
-                                  "initializing block chain (i=12345678)" + info +
-                                  " block size: 4096 bytes" + info +
-                                  " file size: 81920000 bytes, 20000 full blocks available" + info +
-                                  "Opened " USERDATA_DEVICE " for writing" + info + "Success\\n\n");
+  std::string log;
+  for (const char* line : {"Creating reserved area 81920000 bytes", "  block dev: " USERDATA_DEVICE,
+                           "encryptable: yes", "  encrypted: no", "initial CRC: 12345678",
+                           "initializing block chain (i=12345678)", " block size: 4096 bytes",
+                           " file size: 81920000 bytes, 20000 full blocks available",
+                           "Opened " USERDATA_DEVICE " for writing", "Success"}) {
+    log += std::string("I reserveblocks: ") + line + "\\n\n";
+  }
+  EXPECT_EQ(tool_log(device), log);
 
-  // One 64 KiB chunk and a one-byte tail; the read-out of the unarmed file that follows prints
-  // no progress and a zero header.
+  // One chunk and a one-byte tail; reading the unarmed file out prints no progress, a zero header.
   const std::string small = kDir + "small", out = kDir + "small.out";
   r = device.run({"-p", "-c", "65537", "-r", out, small});
   ASSERT_EQ(r.status, 0) << device.log();
   EXPECT_EQ(r.err, "0/1\n1/1\n");
   EXPECT_EQ(r.out, header_lines(0, 0, 0));
-  struct stat st;
-  ASSERT_EQ(stat(device.host_path(small).c_str(), &st), 0);
-  EXPECT_EQ(st.st_size, 65537);
-  EXPECT_EQ(st.st_mode & 07777, 0660u);
-  ASSERT_EQ(stat(device.host_path(out).c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 07777, 0666u);
+  namespace fs = std::filesystem;
+  EXPECT_EQ(fs::file_size(device.host_path(small)), 65537u);
+  EXPECT_EQ(fs::status(device.host_path(small)).permissions(), fs::perms(0660));
+  EXPECT_EQ(fs::status(device.host_path(out)).permissions(), fs::perms(0666));
   EXPECT_EQ(device.read_file(out), std::string(16 * 4096, '\xFF'));
 }
 
-// Every block is mapped before anything is written: a file smaller than a block and a file
-// with a hole (block 3) leave their blocks and device block 0 as they were; nor does a file
-// whose block device cannot be found.
+// Every block is mapped before anything is written: refused files (255) and lookup failures (1)
+// leave their blocks and device block 0 as they were.
 TEST(Conversion, RefusedFilesAndLookupFailures) {
   FakeDevice device(64ull << 20);
   REQUIRE_DEVICE(device);
@@ -88,7 +85,6 @@ TEST(Conversion, RefusedFilesAndLookupFailures) {
   const std::vector<long> holey_blocks = map_file(device, holey, 8);
   ASSERT_EQ(holey_blocks[3], 0);
 
-  // Refused files (255) and lookup failures (1): nothing is written.
   device.write_file("/vendor/elsewhere", "x");
   const struct {
     std::vector<std::string> args;
@@ -112,7 +108,7 @@ TEST(Conversion, RefusedFilesAndLookupFailures) {
     EXPECT_TRUE(contains(tool_log(device), "E reserveblocks: " + c.log)) << device.log();
     EXPECT_TRUE(raw_blocks(device, map_file(device, file, 8)) == before) << file;
   }
-  // The read-out does not refuse a hole: it copies device block 0 in its place.
+  // The read-out copies device block 0 in place of a hole.
   ASSERT_EQ(device.run({"-r", kDir + "holey.out", holey}).status, 0) << device.log();
   const std::string copied = device.read_file(kDir + "holey.out");
   EXPECT_TRUE(copied == raw_blocks(device, holey_blocks));
@@ -145,15 +141,15 @@ TEST(Arming, FragmentedFileReadOutAndIntegrityTest) {
   EXPECT_EQ(verify_chain(device, blocks, 0x5eed, true), "");
   auto offset_of = [&](size_t i) { return static_cast<uint64_t>(blocks[i]) * 4096; };
 
-  // The read-out is the raw blocks in logical order; marked payloads show any other order.
+  // Marked payloads show a read-out in any order but the logical one.
   for (size_t i = 0; i < blocks.size(); ++i) {
     device.write_raw(offset_of(i) + 16, "logical block " + std::to_string(i));
   }
   ASSERT_EQ(device.run({"-r", kDir + "out", path}).status, 0) << device.log();
   EXPECT_TRUE(device.read_file(kDir + "out") == raw_blocks(device, blocks));
 
-  // The integrity test, which wins over -r: the good chain; two stored CRCs damaged (the
-  // first one reported, exit 0); a damaged magic (254). The part of the log after the lookup:
+  // The integrity test wins over -r: good; two CRCs damaged (the first reported, exit 0); a bad
+  // magic (254). Returns the log after the lookup.
   auto walk = [&](int status) {
     device.clear_log();
     RunResult t = device.run({"-t", "-i", "5eed", "-r", kDir + "not-made", path});
@@ -178,7 +174,6 @@ TEST(Arming, FragmentedFileReadOutAndIntegrityTest) {
   EXPECT_EQ(walk(254), mismatch + std::string(bad_magic));
   EXPECT_FALSE(device.exists(kDir + "not-made"));
 
-  // Re-arming with another initial CRC rewrites every header.
   ASSERT_EQ(device.run({"-i", "abcdef01", path}).status, 0);
   EXPECT_EQ(verify_chain(device, blocks, 0xabcdef01, true), "");
 }

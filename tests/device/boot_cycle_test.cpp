@@ -28,7 +28,7 @@ mode_t mode_of(const FakeDevice& device, const std::string& path) {
   return stat(device.host_path(path).c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
 }
 
-// Writes the files into the root and lets the simulated firmware store them as a dump.
+// The simulated firmware stores the files as a dump.
 void simulate_crash(FakeDevice& device, const Files& files) {
   std::vector<std::string> args = {MISC_DEVICE, USERDATA_DEVICE};
   for (const auto& file : files) {
@@ -42,21 +42,21 @@ void simulate_crash(FakeDevice& device, const Files& files) {
 TEST(BootEntry, RequestFileAndEnableFull) {
   FakeDevice device(16 * kGiB);
   REQUIRE_DEVICE(device);
+  auto misc = [&](size_t at, size_t n) { return device.misc_bytes().substr(at, n); };
+  auto logged = [&](const std::string& text) { return contains(tool_log(device), text); };
   device.write_file("/data/vendor/ramdump/kvdump.rdmp", "old");
 
-  // Disabled with no request file: the file is created empty for everyone, the feature's
-  // files deleted; the missing reserved file makes the result.
+  // Disabled, no request file: it is created empty for everyone, the feature's files deleted;
+  // the missing reserved file makes the result.
   set_misc_item(device, 3216, "DiSa");
-  RunResult r = device.run({"-a"});
-  EXPECT_EQ(r.status, 255);
+  EXPECT_EQ(device.run({"-a"}).status, 255);
   EXPECT_EQ(mode_of(device, kStatus), 0666u);
   EXPECT_EQ(device.read_file(kStatus), "");
-  EXPECT_EQ(device.misc_bytes().substr(3136, 4), std::string(4, '\xFF'));
+  EXPECT_EQ(misc(3136, 4), std::string(4, '\xFF'));
   EXPECT_FALSE(device.exists("/data/vendor/ramdump/kvdump.rdmp"));
   EXPECT_EQ(device.property("debug.kvo.kvdump"), "fail");
-  EXPECT_TRUE(contains(tool_log(device), "E reserveblocks: Failed to delete " +
-                                             std::string(kReserved) +
-                                             ": No such file or directory\\n\n"));
+  EXPECT_TRUE(logged("E reserveblocks: Failed to delete " + std::string(kReserved) +
+                     ": No such file or directory\\n\n"));
 
   // "disable" on the first line wins over a later "enable".
   set_misc_item(device, 3216, "EnAb");
@@ -64,43 +64,41 @@ TEST(BootEntry, RequestFileAndEnableFull) {
   device.write_file(kStatus, "disable\nenable\n", 0666);
   for (const char* file : {kReserved, kOutput, kMessage}) device.write_file(file, "x");
   device.clear_log();
-  r = device.run({"-a"});
-  EXPECT_EQ(r.status, 0);
-  EXPECT_EQ(device.misc_bytes().substr(3184, 24), std::string(24, '\0'));
-  EXPECT_EQ(device.misc_bytes().substr(3216, 4), "DiSa");
-  EXPECT_TRUE(contains(tool_log(device), "I reserveblocks: Disabling ramdump\\n\n"));
+  EXPECT_EQ(device.run({"-a"}).status, 0);
+  EXPECT_EQ(misc(3184, 24), std::string(24, '\0'));
+  EXPECT_EQ(misc(3216, 4), "DiSa");
+  EXPECT_TRUE(logged("I reserveblocks: Disabling ramdump\\n\n"));
   for (const char* gone : {kReserved, kOutput, kMessage, kOutDir, "/data/vendor/ramdump/apq"}) {
     EXPECT_FALSE(device.exists(gone)) << gone;
   }
 
-  // "enabled" begins with "enable"; nothing stored: "No ramdump found".
+  // "enabled" begins with "enable". "enable full" ignores the request file and the block address
+  // item and exits 0; near misses convert the missing file "enable". Nothing is stored.
   device.write_file(kReserved, std::string(8 * 4096, '\xFF'));
-  set_misc_item(device, 3216, "DiSa");
-  device.write_file(kStatus, "enabled", 0666);
-  r = device.run({"-a"});
-  EXPECT_EQ(r.status, 255);
-  EXPECT_EQ(device.misc_bytes().substr(3216, 4), "EnAb");
-  EXPECT_TRUE(contains(tool_log(device), "I reserveblocks: Enabling ramdump\\n\n")) << device.log();
-  EXPECT_TRUE(contains(tool_log(device), kNoDump)) << device.log();
-  EXPECT_EQ(device.property("debug.kvo.kvdump"), "fail");
-
-  // "enable full" enables, runs the cycle, leaves the block address item alone and exits 0;
-  // anything else is a conversion of the missing file "enable".
-  device.write_file(kStatus, "disable", 0666);
-  set_misc_item(device, 3136, "LBA!");
-  for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
-           {"enable", "full"}, {"enable", "fullx"}, {"enable", "full", "x"}, {"enabl", "full"}}) {
-    const bool special = args.size() == 2 && args[1] == "full" && args[0] == "enable";
+  const struct {
+    std::vector<std::string> args;
+    const char* request;
+    int status;
+  } steps[] = {{{"-a"}, "enabled", 255},
+               {{"enable", "full"}, "disable", 0},
+               {{"enable", "fullx"}, "disable", 1},
+               {{"enable", "full", "x"}, "disable", 1},
+               {{"enabl", "full"}, "disable", 1}};
+  for (const auto& s : steps) {
+    SCOPED_TRACE(s.args[0] + " " + s.args.back());
+    const bool cycle = s.status != 1, auto_entry = s.args[0] == "-a";
+    device.write_file(kStatus, s.request, 0666);
     set_misc_item(device, 3216, "DiSa");
+    set_misc_item(device, 3136, "LBA!");
     device.set_property("debug.kvo.kvdump", "");
     device.clear_log();
-    r = device.run(args);
-    EXPECT_EQ(r.status, special ? 0 : 1) << args[1];
-    EXPECT_EQ(device.misc_bytes().substr(3216, 4), special ? "EnAb" : "DiSa") << args[1];
-    EXPECT_EQ(device.property("debug.kvo.kvdump"), special ? "fail" : "") << args[1];
-    EXPECT_EQ(contains(tool_log(device), kNoDump), special) << device.log();
+    EXPECT_EQ(device.run(s.args).status, s.status);
+    EXPECT_EQ(misc(3216, 4), cycle ? "EnAb" : "DiSa");
+    EXPECT_EQ(misc(3136, 4), auto_entry ? std::string(4, '\xFF') : "LBA!");
+    EXPECT_EQ(device.property("debug.kvo.kvdump"), cycle ? "fail" : "");
+    EXPECT_EQ(logged(kNoDump), cycle) << device.log();
+    EXPECT_EQ(logged("I reserveblocks: Enabling ramdump\\n\n"), auto_entry) << device.log();
   }
-  EXPECT_EQ(device.misc_bytes().substr(3136, 4), "LBA!");
 }
 
 TEST(AutoCycle, SpaceThresholdsAndUnusableReservedFile) {
@@ -111,23 +109,21 @@ TEST(AutoCycle, SpaceThresholdsAndUnusableReservedFile) {
                     disabling =
                         "E reserveblocks: Disabling ramdump due to not enough free space\\n\n";
   const struct {
-    const char* what;
-    bool reserved, immutable;  // a reserved file is present; it cannot be opened for writing
+    bool reserved, immutable;  // present; not openable for writing, which counts as missing
     uint64_t free;
-    std::string log;  // expected in the tool's log
+    std::string log;
   } cases[] = {
-      {"missing, one block short of 10 GiB", false, false, kCreate - 4096,
+      {false, false, kCreate - 4096,
        short_of + "reserved file: have 10737414144 bytes, need 10737418240 bytes\\n\n" + disabling},
-      {"present, one block short of 6 GiB", true, false, kKeep - 4096,
+      {true, false, kKeep - 4096,
        short_of + "output file: have 6442446848 bytes, need 6442450944 bytes\\n\n" + disabling},
-      {"present, exactly 6 GiB", true, false, kKeep, kNoDump},
-      // Not writable counts as missing: at exactly 10 GiB the creation is attempted and fails.
-      {"not writable, exactly 10 GiB", true, true, kCreate,
+      {true, false, kKeep, kNoDump},
+      {true, true, kCreate,
        "E reserveblocks: failed to open file:/data/vendor/ramdump/RAMDUMP_RESERVED for writing: "
        "Operation not permitted\\n\n"},
   };
   for (const auto& c : cases) {
-    SCOPED_TRACE(c.what);
+    SCOPED_TRACE(c.free);
     device.remove(kReserved);
     std::filesystem::remove_all(device.host_path("/data/filler"));
     if (c.reserved) device.write_file(kReserved, std::string(4 * 4096, '\xFF'));
@@ -141,10 +137,8 @@ TEST(AutoCycle, SpaceThresholdsAndUnusableReservedFile) {
     EXPECT_EQ(device.run({"-a"}).status, 255);
     EXPECT_TRUE(contains(tool_log(device), c.log)) << device.log();
     const bool disabled = contains(c.log, disabling);
-    EXPECT_EQ(device.misc_bytes().substr(3216, 4), disabled ? "DiSa" : "EnAb");
-    if (disabled) {
-      EXPECT_EQ(device.misc_bytes().substr(3184, 24), std::string(24, '\0'));
-    }
+    EXPECT_EQ(device.misc_bytes().substr(disabled ? 3184 : 3216, disabled ? 36 : 4),
+              disabled ? std::string(32, '\0') + "DiSa" : "EnAb");
     EXPECT_EQ(device.exists(kReserved), c.reserved);  // disabling leaves the file
     if (c.immutable) system(("chattr -i " + device.host_path(kReserved)).c_str());
   }
@@ -183,14 +177,13 @@ TEST(AutoCycle, StateWordAndReadOutOfASmallChain) {
     EXPECT_EQ(std::filesystem::file_size(device.host_path(kOutput)), count * 4096u);
     EXPECT_EQ(device.read_file(kMessage), files[1].second);
     EXPECT_FALSE(device.exists(std::string(kOutDir) + "/firmware_log.bin"));
-    EXPECT_EQ(mode_of(device, kOutDir), 0777u);
-    EXPECT_EQ(mode_of(device, "/data/vendor/ramdump/apq"), 0777u);
-    EXPECT_EQ(mode_of(device, kOutput), 0666u);
+    for (const char* made : {kOutDir, "/data/vendor/ramdump/apq", kOutput}) {
+      EXPECT_EQ(mode_of(device, made), made == kOutput ? 0666u : 0777u) << made;
+    }
   }
 }
 
-// Full size: the first boot creates and arms 4224 MiB with exactly 10 GiB free, the firmware
-// stores a dump, the second boot collects and re-arms, the third finds nothing.
+// Boots at full size: create and arm at exactly 10 GiB free; collect and re-arm; find nothing.
 TEST(AutoCycle, FullCrashCycleAtFullSize) {
   FakeDevice device(16 * kGiB);
   REQUIRE_DEVICE(device);

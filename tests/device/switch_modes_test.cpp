@@ -18,17 +18,14 @@ namespace {
 
 const char kUsage[] =
     "usage: reserveblocks [-a] [-d] [-e] [-s] [-p] [-r <out file>] [-c <size>] [-t] [-i <crc>] "
-    "<block file>\n"
-    "    -r <out file> read from raw block of <block file> to <out file>\n"
-    "    -c <size>     also create <block file> of size and convert\n\n"
-    "    -t            test block chain integrity\n    -p            print progress\n"
-    "    -i <crc>      specify initial hex crc value\n"
-    "    -a            auto read out raw blocks then rearm block chain\n"
-    "    -d            disable ramdump\n    -e            enable ramdump\n"
-    "    -s            print ramdump status\n"
-    "Convert between raw blocks and files.  If only <block file> parameter\n"
-    "is supplied, then just re-write <block file> as raw data.  <block file> must\n"
-    "exist, otherwise, use the -c option to create the file before\nconverting it.\n";
+    "<block file>\n    -r <out file> read from raw block of <block file> to <out file>\n    -c "
+    "<size>     also create <block file> of size and convert\n\n    -t            test block chain "
+    "integrity\n    -p            print progress\n    -i <crc>      specify initial hex crc value\n"
+    "    -a            auto read out raw blocks then rearm block chain\n    -d            disable "
+    "ramdump\n    -e            enable ramdump\n    -s            print ramdump status\nConvert "
+    "between raw blocks and files.  If only <block file> parameter\nis supplied, then just "
+    "re-write <block file> as raw data.  <block file> must\nexist, otherwise, use the -c option to "
+    "create the file before\nconverting it.\n";
 
 const std::string kOpenFailed = std::string("Error: ") + MISC_DEVICE + " open failed.\n";
 const char kEnableFailed[] =
@@ -39,15 +36,20 @@ std::string patched(std::string image, size_t offset, const std::string& bytes) 
   return image.replace(offset, bytes.size(), bytes);
 }
 
-// Each step runs on the image the steps before it left. The image is filled with 0xA5, so that
-// any byte written besides a mode's items shows, and 0xA5 is not "DiSa": enabled. Only failures
-// log; "" for the image: no misc partition.
+// Steps on the image the ones before left, filled with 0xA5 (enabled: not "DiSa") so that any
+// stray byte shows; only failures log; image "": no misc partition.
 TEST(SwitchModes, CommandLinesAndTheItemsEachModeWrites) {
   FakeDevice device;
   REQUIRE_DEVICE(device);
   const std::string blank(1 << 20, '\xA5'), enabled = patched(blank, 3216, "EnAb");
   const std::string disabled = patched(patched(enabled, 3184, std::string(24, '\0')), 3216, "DiSa");
   write_host_file(device.misc_host_path(), blank);
+  const std::string
+      no_misc = kOpenFailed + "Error: open partition failed, item=",
+      read_failed = "E reserveblocks: error reading ramdump enable flag from MISC partition\\n\n",
+      disable_failed =
+          "E reserveblocks: error writing ramdump disable initial block header to "
+          "MISC partition\\n\nE reserveblocks: failed to disable ramdump\\n\n";
   const struct {
     std::vector<std::string> args;
     int status;
@@ -63,30 +65,21 @@ TEST(SwitchModes, CommandLinesAndTheItemsEachModeWrites) {
       {{"-d"}, 0, "Ramdump disabled\n", disabled},
       {{"-s"}, 0, "Ramdump disabled\n", disabled},
       {{"-e"}, 0, "Ramdump enabled\n", patched(disabled, 3216, "EnAb")},
-      {{"-s"},
-       0,
-       kOpenFailed + "Error: open partition failed, item=3\nRamdump disabled\n",
-       "",
-       "E reserveblocks: error reading ramdump enable flag from MISC partition\\n\n"},
-      {{"-e"}, 1, kOpenFailed + "Error: open partition failed, item=3.\n", "", kEnableFailed},
-      {{"-d"},
-       1,
-       kOpenFailed + "Error: open partition failed, item=2.\n",
-       "",
-       "E reserveblocks: error writing ramdump disable initial block header to MISC "
-       "partition\\n\nE reserveblocks: failed to disable ramdump\\n\n"},
+      {{"-s"}, 0, no_misc + "3\nRamdump disabled\n", "", read_failed},
+      {{"-e"}, 1, no_misc + "3.\n", "", kEnableFailed},
+      {{"-d"}, 1, no_misc + "2.\n", "", disable_failed},
   };
   for (const auto& step : steps) {
-    const std::string shown = step.args.empty() ? "(none)" : step.args[0];
+    SCOPED_TRACE(&step - steps);
     if (step.image.empty()) device.remove(MISC_DEVICE);
     device.clear_log();
     RunResult r = device.run(step.args);
-    EXPECT_EQ(r.status, step.status) << shown;
-    EXPECT_EQ(r.out, step.out) << shown;
-    EXPECT_EQ(r.err, step.status == 2 || step.args.empty() ? kUsage : "") << shown;
-    EXPECT_TRUE(device.misc_bytes() == step.image) << shown;
+    EXPECT_EQ(r.status, step.status);
+    EXPECT_EQ(r.out, step.out);
+    EXPECT_EQ(r.err, step.status == 2 || step.args.empty() ? kUsage : "");
+    EXPECT_TRUE(device.misc_bytes() == step.image);
     if (step.status == 0 || step.log != "") {
-      EXPECT_EQ(device.log(), step.log) << shown;
+      EXPECT_EQ(device.log(), step.log);
     }
   }
   // A build host has neither a log daemon nor a property service: without the log file the
@@ -97,11 +90,9 @@ TEST(SwitchModes, CommandLinesAndTheItemsEachModeWrites) {
   EXPECT_FALSE(device.exists("/dev/__log__") || device.exists("/dev/__properties__"));
 }
 
-// One access per row, in a process of its own, on an image whose byte i is i % 251, with a
-// 32-byte buffer of 0xEE (reads) or of 1, 2, 3... (writes). A read brings the item's whole
-// length, a write changes exactly the item; a failed access moves nothing; no access leaves
-// the partition open. The path is settled at the first access of a process: the primary one if
-// it opens then, with no fallback afterwards, else the secondary one for good.
+// One access per process on an image of i % 251, with a buffer of 0xEE (reads) or 1, 2, 3...
+// (writes): an access moves the item's whole length or nothing and leaves the partition closed.
+// The first access settles the path: the primary one if it opens then, for good.
 TEST(MiscStore, ItemAccess) {
   FakeDevice device;
   REQUIRE_DEVICE(device);
@@ -117,10 +108,6 @@ TEST(MiscStore, ItemAccess) {
     std::string out = "";
     bool partition = true, primary = false;
   } cases[] = {
-      {[](uint8_t* b) { return MISC_read_RamdumpEnable(b); }, 0, false, 3216, 4},
-      {[](uint8_t* b) { return MISC_write_RamdumpEnable(b); }, 0, true, 3216, 4},
-      {[](uint8_t* b) { return MISC_read_RamdumpIBH(b); }, 0, false, 3184, 24},
-      {[](uint8_t* b) { return MISC_write_RamdumpIBH(b); }, 0, true, 3184, 24},
       {[](uint8_t* b) { return MISC_write_RamdumpLBA(b); }, 0, true, 3136, 4},
       {[](uint8_t* b) { return mfg_emmc_read(4, b, 4); }, 0, false, 3160, 4},
       {[](uint8_t* b) { return mfg_emmc_write(4, b, 4); }, 0, true, 3160, 4},
@@ -159,6 +146,7 @@ TEST(MiscStore, ItemAccess) {
   };
   for (size_t k = 0; k < sizeof(cases) / sizeof(cases[0]); ++k) {
     const auto& c = cases[k];
+    SCOPED_TRACE(k);
     write_host_file(device.misc_host_path(), image);
     if (!c.partition) device.remove(MISC_DEVICE);
     device.remove(MISC_PATH_PRIMARY);
@@ -177,14 +165,13 @@ TEST(MiscStore, ItemAccess) {
       }
       return -rc;
     });
-    EXPECT_EQ(r.status, -c.rc) << "row " << k;
-    EXPECT_EQ(r.out, c.out) << "row " << k;
+    EXPECT_EQ(r.status, -c.rc);
+    EXPECT_EQ(r.out, c.out);
     const std::string moved =
         c.write ? buffer.substr(0, c.length) : image.substr(c.offset, c.length);
-    EXPECT_TRUE(r.err == (c.write ? buffer : patched(buffer, 0, moved))) << "row " << k;
+    EXPECT_TRUE(r.err == (c.write ? buffer : patched(buffer, 0, moved)));
     if (c.partition) {
-      EXPECT_TRUE(device.misc_bytes() == (c.write ? patched(image, c.offset, moved) : image))
-          << "row " << k;
+      EXPECT_TRUE(device.misc_bytes() == (c.write ? patched(image, c.offset, moved) : image));
     }
   }
 }

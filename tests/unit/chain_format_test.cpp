@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 #include <stdio.h>
-#include <string.h>
 #include <unistd.h>
 
 #include <string>
@@ -13,8 +12,8 @@
 
 namespace {
 
-// Arms a chain over the blocks into a sparse file standing in for the raw device, with the
-// arming's own writer, and returns the 16-byte header of every chain block read back from it.
+// Arms a chain with the arming's own writer into a sparse file standing in for the raw device
+// and returns every chain block's 16-byte header as read back.
 std::vector<std::string> arm(const std::vector<int64_t>& blocks, uint32_t initial_crc) {
   FILE* device = tmpfile();
   std::vector<uint8_t> buffer(MAX_RUN_BLOCKS * 4096, 0);
@@ -30,9 +29,9 @@ std::vector<std::string> arm(const std::vector<int64_t>& blocks, uint32_t initia
 }
 
 std::string bytes(const chain_block_header& h) {
-  uint8_t out[16];
-  encode_chain_block_header(h, out);
-  return std::string(reinterpret_cast<char*>(out), sizeof(out));
+  std::string out(16, '\0');
+  encode_chain_block_header(h, reinterpret_cast<uint8_t*>(&out[0]));
+  return out;
 }
 
 TEST(ChainWriter, KnownChains) {
@@ -47,8 +46,7 @@ TEST(ChainWriter, KnownChains) {
         {CHAIN_BLOCK_MAGIC, 0x2000, 0, 1, 0x688442A6},
         {CHAIN_BLOCK_MAGIC, 0, 0, 1, 0x394A06EC}}},
       {{0x1000, 0x1001, 0x2000}, 0, {{CHAIN_BLOCK_MAGIC, 0x1001, 0, 2, 0xA66687B2}}},
-      // The example's last block alone, continuing from the CRC before it.
-      {{0x2000}, 0x688442A6, {{CHAIN_BLOCK_MAGIC, 0, 0, 1, 0x394A06EC}}},
+      {{0x2000}, 0x688442A6, {{CHAIN_BLOCK_MAGIC, 0, 0, 1, 0x394A06EC}}},  // one block alone
   };
   for (const auto& c : cases) {
     auto got = arm(c.blocks, c.initial_crc);
@@ -58,9 +56,8 @@ TEST(ChainWriter, KnownChains) {
   }
 }
 
-// 1025 consecutive blocks, then blocks of which no two follow each other (descending by one
-// is not a run): the run is cut after 1024 blocks, which changes run_remaining only, never the
-// links, and every other block is a run of its own.
+// 1025 consecutive blocks, then none that follow each other (descending by one is no run): the
+// cut after 1024 changes run_remaining only, never the links.
 TEST(ChainWriter, LongRunIsCut) {
   std::vector<int64_t> blocks;
   for (int64_t b = 100; b < 100 + 1025; ++b) blocks.push_back(b);
@@ -73,31 +70,25 @@ TEST(ChainWriter, LongRunIsCut) {
   }
 }
 
-// Encodes the value and checks the exact bytes; then encodes the decoded bytes again, which
-// brings every field back only if the decoder reads each one at its offset.
-template <typename T>
-void check_layout(void (*encode)(const T&, uint8_t*), T (*decode)(const uint8_t*), const T& value,
-                  const std::string& expected) {
-  std::string out(expected.size(), '\xAA');
-  encode(value, reinterpret_cast<uint8_t*>(&out[0]));
-  EXPECT_EQ(out, expected);
-  out.assign(expected.size(), '\xAA');
-  encode(decode(reinterpret_cast<const uint8_t*>(expected.data())),
-         reinterpret_cast<uint8_t*>(&out[0]));
-  EXPECT_EQ(out, expected);
-}
-
+// Exact bytes, then the decoded bytes encoded again: every field comes back only if the decoder
+// reads it at its offset.
 TEST(ChainRecords, ByteLayout) {
   using namespace std::string_literals;
-  check_layout(encode_chain_block_header, decode_chain_block_header,
-               {CHAIN_BLOCK_MAGIC, 0x11223344, 0x5566, 0x0400, 0xA1B2C3D4},
-               "BCho\x44\x33\x22\x11\x66\x55\0\x04\xD4\xC3\xB2\xA1"s);
-  check_layout(encode_initial_block_header, decode_initial_block_header,
-               {INITIAL_BLOCK_HEADER_MAGIC, 0x00012345, 4096, 0x10800, 0xCAFEF00D, STATE_ARMED},
-               "BHdr\x45\x23\x01\0\0\x10\0\0\0\x08\x01\0\x0D\xF0\xFE\xCA\x01\0\0\0"s);
-  check_layout(
+  auto check = [](auto encode, auto decode, const auto& value, const std::string& expected) {
+    std::string out(expected.size(), '\xAA'), again = out;
+    encode(value, reinterpret_cast<uint8_t*>(&out[0]));
+    encode(decode(reinterpret_cast<const uint8_t*>(expected.data())),
+           reinterpret_cast<uint8_t*>(&again[0]));
+    EXPECT_EQ(out, expected);
+    EXPECT_EQ(again, expected);
+  };
+  check(encode_chain_block_header, decode_chain_block_header,
+        chain_block_header{CHAIN_BLOCK_MAGIC, 0x11223344, 0x5566, 0x0400, 0xA1B2C3D4},
+        "BCho\x44\x33\x22\x11\x66\x55\0\x04\xD4\xC3\xB2\xA1"s);
+  check(
       encode_dump_file_record, decode_dump_file_record,
-      {DUMP_FILE_MAGIC, "RAMDUMP_MSG.txt", 0x0102030405060708ull, 0xF0E0D0C0B0A09080ull},
+      dump_file_record{DUMP_FILE_MAGIC, "RAMDUMP_MSG.txt", 0x0102030405060708ull,
+                       0xF0E0D0C0B0A09080ull},
       "F1LeRAMDUMP_MSG.txt\0\0\0\0\0\x08\x07\x06\x05\x04\x03\x02\x01\x80\x90\xA0\xB0\xC0\xD0\xE0\xF0"s);
 }
 
@@ -105,13 +96,12 @@ TEST(ChainRecords, ByteLayout) {
 TEST(RetryIo, ShortReadAndReadError) {
   FILE* f = tmpfile();
   ASSERT_EQ(write_retry(fileno(f), "0123456789", 10), 0);
+  std::string buf(32, 'x');
   ASSERT_EQ(lseek(fileno(f), 0, SEEK_SET), 0);
-  char buf[32];
-  memset(buf, 'x', sizeof(buf));
-  EXPECT_EQ(read_retry(fileno(f), buf, sizeof(buf)), 0);
-  EXPECT_EQ(std::string(buf, 11), "0123456789x");
+  EXPECT_EQ(read_retry(fileno(f), &buf[0], buf.size()), 0);
+  EXPECT_EQ(buf.substr(0, 11), "0123456789x");
   fclose(f);
-  EXPECT_EQ(read_retry(-1, buf, sizeof(buf)), -1);
+  EXPECT_EQ(read_retry(-1, &buf[0], buf.size()), -1);
 }
 
 }  // namespace

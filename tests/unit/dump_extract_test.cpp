@@ -20,7 +20,6 @@ namespace {
 constexpr size_t kUnit = 4096;
 constexpr size_t kPayload = kUnit - CHAIN_BLOCK_HEADER_SIZE;
 constexpr auto npos = std::string::npos;
-// What the filter logs at the zeros that follow the last record.
 const char kZeroMagic[] = "E * bad magic, got 00000000, expecting 654c3146\n";
 
 std::string logged;  // "<I|E> <message>" per record
@@ -51,8 +50,7 @@ class DumpExtract : public testing::Test {
     std::filesystem::remove_all(dir_);
   }
 
-  // Extracts from the read-out with a fresh filter and log; returns what went to standard
-  // error, and the message file's content in *message ("(none)" when there is none).
+  // Returns standard error; *message is the message file, "(none)" when there is none.
   std::string extract(const std::string& readout, std::string* message) {
     reset_dump_filter_state_for_test();
     logged.clear();
@@ -69,10 +67,8 @@ class DumpExtract : public testing::Test {
   std::string dir_;
 };
 
-// Record headers across unit boundaries: `first` bytes of one at the end of the first payload,
-// `second` bytes of the next at the end of the second. The bytes carried into the next unit
-// come from the end of the unit as read, so splits of up to 16 bytes come out whole; longer
-// ones end the extraction at a bad record magic.
+// `first` bytes of a record header end the first payload, `second` bytes of the next end the
+// second: the carry comes from the end of the unit as read, so only splits up to 16 come whole.
 TEST_F(DumpExtract, RecordHeadersAcrossUnits) {
   const std::string msg = pattern(5000, 3);
   struct {
@@ -93,8 +89,6 @@ TEST_F(DumpExtract, RecordHeadersAcrossUnits) {
   }
 }
 
-// Read-outs that end the extraction early or oddly: what goes to standard error, the message
-// file and the whole log.
 TEST_F(DumpExtract, Endings) {
   const std::string msg = pattern(6000, 7),
                     two_units = readout_units(record("RAMDUMP_MSG.txt", msg));
@@ -104,7 +98,6 @@ TEST_F(DumpExtract, Endings) {
   const std::string filler = record("KLOG", pattern(kPayload - 80, 5));  // ends a payload
   const std::string tail = record("RAMDUMP_MSG.txt", "msg") + record("FW", pattern(kPayload, 9));
   const std::string huger = dump_record("RAMDUMP_MSG.txt", ~0ull, "k") + tail;
-  // The payloads after the first record header, which a record of a huge size takes.
   auto rest = [](const std::string& readout) {
     std::string payloads;
     for (size_t at = 0; at < readout.size(); at += kUnit)
@@ -116,8 +109,7 @@ TEST_F(DumpExtract, Endings) {
     const char* what;
     std::string readout, err, message, log;
   } cases[] = {
-      // A zero-length item is never reported as written, so a wanted record of size 0 fails as
-      // soon as any data follows it, in the same payload or the next unit.
+      // A zero-length write never reports success: an empty wanted record fails once data follows.
       {"empty wanted record, data in the next unit", readout_units(filler + empty_wanted + tail),
        "Could not write 0 bytes", "", found + "0\n"},
       {"empty wanted record, nothing after it", readout_units(filler + empty_wanted), "", "",
@@ -127,8 +119,7 @@ TEST_F(DumpExtract, Endings) {
        found + "6000\n"},
       {"partial last unit: never looked at", two_units.substr(0, kUnit + 1000), "",
        msg.substr(0, kPayload - 40), found + "6000\n"},
-      // Sizes beyond the data: a record that is not wanted swallows everything after it, a wanted
-      // one takes it all, even with a size past the signed range.
+      // Sizes beyond the data swallow the rest, even past the signed range.
       {"huge record before the wanted one",
        readout_units(dump_record("KLOG", 1ull << 40, "k") + tail), "", "(none)", ""},
       {"wanted record past the signed range", readout_units(huger), "", rest(readout_units(huger)),
@@ -146,8 +137,7 @@ TEST_F(DumpExtract, Endings) {
             "Unable to open /nonexistent/RAMDUMP_OUTPUT for reading\n");
 }
 
-// The output path is built for every record; one longer than 4096 characters ends the process
-// instead of being cut short.
+// The path is built for every record; one over 4096 characters ends the process, never cut short.
 TEST_F(DumpExtract, OutputPathLimit) {
   const std::string stream = record("FW_DIAG", ""), fits(4096 - strlen("/FW_DIAG"), 'd');
   FILE* out = nullptr;
