@@ -77,11 +77,8 @@ TEST(Conversion, RefusedFilesAndLookupFailures) {
   REQUIRE_DEVICE(device);
   const std::string tiny = kDir + "tiny", holey = kDir + "holey";
   device.write_file(tiny, std::string(100, 'x'));
-  const std::string h(4 * 4096, 'h');
-  int fd = open(device.host_path(holey).c_str(), O_WRONLY | O_CREAT, 0644);
-  ASSERT_EQ(pwrite(fd, h.data(), 3 * 4096, 0), 3 * 4096);
-  ASSERT_EQ(pwrite(fd, h.data(), 4 * 4096, 4 * 4096), 4 * 4096);
-  close(fd);
+  device.write_file(holey, std::string(8 * 4096, 'h'));
+  ASSERT_EQ(system(("fallocate -p -o 12288 -l 4096 " + device.host_path(holey)).c_str()), 0);
   const std::vector<long> holey_blocks = map_file(device, holey, 8);
   ASSERT_EQ(holey_blocks[3], 0);
 
@@ -112,7 +109,7 @@ TEST(Conversion, RefusedFilesAndLookupFailures) {
   ASSERT_EQ(device.run({"-r", kDir + "holey.out", holey}).status, 0) << device.log();
   const std::string copied = device.read_file(kDir + "holey.out");
   EXPECT_TRUE(copied == raw_blocks(device, holey_blocks));
-  EXPECT_EQ(copied.substr(0, 4096), h.substr(0, 4096));
+  EXPECT_EQ(copied.substr(0, 4096), std::string(4096, 'h'));
 
   device.remove("/vendor/etc/fstab.rbtest");
   EXPECT_EQ(device.run({tiny}).status, 1);

@@ -39,65 +39,60 @@ void simulate_crash(FakeDevice& device, const Files& files) {
   ASSERT_EQ(r.status, 0) << r.err;
 }
 
+// -a applies the request file first ("disable" on the first line wins, "enabled" begins with
+// "enable"); "enable full" ignores it and the block address item; near misses convert "enable".
 TEST(BootEntry, RequestFileAndEnableFull) {
   FakeDevice device(16 * kGiB);
   REQUIRE_DEVICE(device);
   auto misc = [&](size_t at, size_t n) { return device.misc_bytes().substr(at, n); };
-  auto logged = [&](const std::string& text) { return contains(tool_log(device), text); };
-  device.write_file("/data/vendor/ramdump/kvdump.rdmp", "old");
-
-  // Disabled, no request file: it is created empty for everyone, the feature's files deleted;
-  // the missing reserved file makes the result.
-  set_misc_item(device, 3216, "DiSa");
-  EXPECT_EQ(device.run({"-a"}).status, 255);
-  EXPECT_EQ(mode_of(device, kStatus), 0666u);
-  EXPECT_EQ(device.read_file(kStatus), "");
-  EXPECT_EQ(misc(3136, 4), std::string(4, '\xFF'));
-  EXPECT_FALSE(device.exists("/data/vendor/ramdump/kvdump.rdmp"));
-  EXPECT_EQ(device.property("debug.kvo.kvdump"), "fail");
-  EXPECT_TRUE(logged("E reserveblocks: Failed to delete " + std::string(kReserved) +
-                     ": No such file or directory\\n\n"));
-
-  // "disable" on the first line wins over a later "enable".
-  set_misc_item(device, 3216, "EnAb");
-  set_misc_item(device, 3184, std::string(24, '\x33'));
-  device.write_file(kStatus, "disable\nenable\n", 0666);
-  for (const char* file : {kReserved, kOutput, kMessage}) device.write_file(file, "x");
-  device.clear_log();
-  EXPECT_EQ(device.run({"-a"}).status, 0);
-  EXPECT_EQ(misc(3184, 24), std::string(24, '\0'));
-  EXPECT_EQ(misc(3216, 4), "DiSa");
-  EXPECT_TRUE(logged("I reserveblocks: Disabling ramdump\\n\n"));
-  for (const char* gone : {kReserved, kOutput, kMessage, kOutDir, "/data/vendor/ramdump/apq"}) {
-    EXPECT_FALSE(device.exists(gone)) << gone;
-  }
-
-  // "enabled" begins with "enable". "enable full" ignores the request file and the block address
-  // item and exits 0; near misses convert the missing file "enable". Nothing is stored.
-  device.write_file(kReserved, std::string(8 * 4096, '\xFF'));
+  const std::string near_miss = "E reserveblocks: failed to convert enabl",
+                    no_reserved = "E reserveblocks: Failed to delete " + std::string(kReserved) +
+                                  ": No such file or directory\\n\n";
   const struct {
     std::vector<std::string> args;
-    const char* request;
+    const char* request;  // nullptr: none, nor a reserved file
+    const char *flag, *flag_after;
     int status;
-  } steps[] = {{{"-a"}, "enabled", 255},
-               {{"enable", "full"}, "disable", 0},
-               {{"enable", "fullx"}, "disable", 1},
-               {{"enable", "full", "x"}, "disable", 1},
-               {{"enabl", "full"}, "disable", 1}};
+    std::string log;
+  } steps[] = {
+      {{"-a"}, nullptr, "DiSa", "DiSa", 255, no_reserved},
+      {{"-a"}, "disable\nenable\n", "EnAb", "DiSa", 0, "I reserveblocks: Disabling ramdump\\n\n"},
+      {{"-a"}, "enabled", "DiSa", "EnAb", 255, "I reserveblocks: Enabling ramdump\\n\n"},
+      {{"enable", "full"}, "disable", "DiSa", "EnAb", 0, kNoDump},
+      {{"enable", "fullx"}, "disable", "DiSa", "DiSa", 1, near_miss},
+      {{"enable", "full", "x"}, "disable", "DiSa", "DiSa", 1, near_miss},
+      {{"enabl", "full"}, "disable", "DiSa", "DiSa", 1, near_miss},
+  };
   for (const auto& s : steps) {
     SCOPED_TRACE(s.args[0] + " " + s.args.back());
-    const bool cycle = s.status != 1, auto_entry = s.args[0] == "-a";
-    device.write_file(kStatus, s.request, 0666);
-    set_misc_item(device, 3216, "DiSa");
+    const bool auto_entry = s.args[0] == "-a", cycle = s.flag_after == std::string("EnAb");
+    if (s.request) {
+      device.write_file(kStatus, s.request, 0666);
+      device.write_file(kReserved, std::string(8 * 4096, '\xFF'));
+    }
+    for (const char* file : {kOutput, kMessage, "/data/vendor/ramdump/kvdump.rdmp"}) {
+      device.write_file(file, "x");
+    }
     set_misc_item(device, 3136, "LBA!");
+    set_misc_item(device, 3184, std::string(24, '\x11'));  // armed, no dump
+    set_misc_item(device, 3216, s.flag);
     device.set_property("debug.kvo.kvdump", "");
     device.clear_log();
     EXPECT_EQ(device.run(s.args).status, s.status);
-    EXPECT_EQ(misc(3216, 4), cycle ? "EnAb" : "DiSa");
     EXPECT_EQ(misc(3136, 4), auto_entry ? std::string(4, '\xFF') : "LBA!");
-    EXPECT_EQ(device.property("debug.kvo.kvdump"), cycle ? "fail" : "");
-    EXPECT_EQ(logged(kNoDump), cycle) << device.log();
-    EXPECT_EQ(logged("I reserveblocks: Enabling ramdump\\n\n"), auto_entry) << device.log();
+    EXPECT_EQ(misc(3184, 24) == std::string(24, '\0'), auto_entry && s.status == 0);
+    EXPECT_EQ(misc(3216, 4), s.flag_after);
+    EXPECT_EQ(device.property("debug.kvo.kvdump"), s.status == 1 ? "" : "fail");
+    EXPECT_TRUE(contains(tool_log(device), s.log)) << device.log();
+    EXPECT_EQ(contains(tool_log(device), kNoDump), cycle) << device.log();
+    EXPECT_EQ(device.exists("/data/vendor/ramdump/kvdump.rdmp"), !auto_entry);
+    for (const char* file : {kReserved, kOutput, kMessage, kOutDir, "/data/vendor/ramdump/apq"}) {
+      EXPECT_EQ(device.exists(file), !auto_entry || cycle) << file;  // disabled: all deleted
+    }
+    if (!s.request) {
+      EXPECT_EQ(mode_of(device, kStatus), 0666u);  // created empty for everyone
+      EXPECT_EQ(device.read_file(kStatus), "");
+    }
   }
 }
 

@@ -1,13 +1,11 @@
 // The command line and the feature switch (-s, -e, -d) on the real binary, and the misc item
 // store on the partition image, inside the fake device root.
-#include <dirent.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <cstring>
+#include <filesystem>
 #include <functional>
-#include <memory>
 #include <string>
 #include <vector>
 
@@ -156,12 +154,9 @@ TEST(MiscStore, ItemAccess) {
     RunResult r = device.run_in_root([&] {
       int rc = c.access(reinterpret_cast<uint8_t*>(&buffer[0]));
       fwrite(buffer.data(), 1, buffer.size(), stderr);
-      std::unique_ptr<DIR, int (*)(DIR*)> fds(opendir("/proc/self/fd"), closedir);
-      char target[256];
-      while (dirent* fd = readdir(fds.get())) {
-        const std::string link = std::string("/proc/self/fd/") + fd->d_name;
-        ssize_t n = readlink(link.c_str(), target, sizeof(target));
-        if (n > 0 && std::string(target, n).find("misc") != std::string::npos) return 99;
+      for (const auto& fd : std::filesystem::directory_iterator("/proc/self/fd")) {
+        std::error_code gone;  // the iterator's own descriptor
+        if (contains(std::filesystem::read_symlink(fd, gone).string(), "misc")) return 99;
       }
       return -rc;
     });
