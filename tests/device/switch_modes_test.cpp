@@ -25,7 +25,7 @@ const char kUsage[] =
     "re-write <block file> as raw data.  <block file> must\nexist, otherwise, use the -c option to "
     "create the file before\nconverting it.\n";
 
-const std::string kOpenFailed = std::string("Error: ") + MISC_DEVICE + " open failed.\n";
+const std::string kOpenFailed = "Error: " MISC_DEVICE " open failed.\n";
 const char kEnableFailed[] =
     "E reserveblocks: error writing ramdump enable flag to MISC partition\\n\n"
     "E reserveblocks: failed to enable ramdump\\n\n";
@@ -132,9 +132,8 @@ TEST(MiscStore, ItemAccess) {
                 MISC_read_RamdumpEnable(b);
        },
        -5, true, 0, 0,
-       std::string("Error: ") + MISC_PATH_PRIMARY +
-           " open failed.\nError: open partition failed, item=3\n",
-       true, true},
+       "Error: " MISC_PATH_PRIMARY " open failed.\nError: open partition failed, item=3\n", true,
+       true},
       {[](uint8_t* b) {
          uint8_t flag[4];
          return MISC_read_RamdumpEnable(flag) + close(creat(MISC_PATH_PRIMARY, 0644)) +
