@@ -1,7 +1,5 @@
-// Failing system calls and hostile on-disk data, run against the real binaries in the fake
-// device root. The preloaded interposer (fault_inject.c) breaks the calls and records every
-// write that reaches the raw device. Each row checks the exit status, standard output, the
-// tool's log, which files changed and which raw blocks were written.
+// Failing system calls (fault_inject.c, preloaded) and hostile on-disk data, for the real
+// binaries in the fake device root: exit status, output, log, changed files and raw writes.
 #include <gtest/gtest.h>
 #include <string.h>
 #include <sys/stat.h>
@@ -38,8 +36,7 @@ const uint32_t kCount = 64;         // blocks of the reserved file
 const uint32_t kCrc = 0x5eed;
 const char kMsgText[] = "watchdog timeout on cpu 3\n";
 
-// Before every row: kArmed armed with kCrc, and the feature enabled with the reserved file
-// holding a dump the firmware stored, its header in the misc partition.
+// Before every row: kArmed armed with kCrc, the feature enabled, and a stored dump.
 struct Context {
   FakeDevice& device;
   std::vector<long> armed, reserved;  // the two chains' blocks
@@ -74,8 +71,8 @@ bool log_matches(const std::string& log, const std::vector<std::string>& records
   return errors == 0;
 }
 
-// Every regular file of the root but /proc and /usr: its size and mode, and a hash of its
-// content unless it is a chain file, whose content changes behind the file system's back.
+// Mode, size and (but for chain files, written behind the file system) a content hash of every
+// regular file of the root but /proc and /usr.
 std::map<std::string, std::string> snapshot(const FakeDevice& device) {
   namespace fs = std::filesystem;
   const std::string root = device.host_path("");
@@ -107,8 +104,7 @@ std::set<std::string> changed(const std::map<std::string, std::string>& before,
   return paths;
 }
 
-// "" when the raw writes recorded by the interposer all lie inside the file's blocks (there
-// must be some) or, without a file, when there are none; otherwise the first that does not.
+// The first raw write outside the file's blocks ("none" if it has none), or "".
 std::string raw_writes(const FakeDevice& device, const char* file) {
   std::set<long> allowed;
   if (file != nullptr) {
@@ -257,6 +253,11 @@ std::vector<Case> cases() {
     {"misc gone before the header is read at boot", "fopen.misc=ENOENT+4", {"-a"}, 255,
      misc_gone + ", item=2\n", {E("Failed to read initial block header from MISC partition")},
      boot, nullptr},
+    {"misc gone for the header stored after re-arming", "fopen.misc=ENOENT#6", {"-a"}, 0,
+     misc_gone + ", item=2.\n",
+     {I("Found file 'RAMDUMP_MSG.txt', size 26"), E("* bad magic, got 00000000, expecting 654c3146"),
+      E("Failed to write new initial block header to MISC partition")},
+     collected, kReserved},
     {"looping chain at boot: read out and re-armed", "", {"-a"}, 0, "",
      {I("Found file 'RAMDUMP_MSG.txt', size 26"), E("* bad magic, got 00000000, expecting 654c3146")},
      collected, kReserved, loop,
