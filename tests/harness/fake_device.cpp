@@ -219,6 +219,9 @@ RunResult FakeDevice::run_in_root(const std::function<int()>& fn, int timeout_se
       _exit(126);
     }
     if (chroot(root_.c_str()) != 0 || chdir("/") != 0) _exit(125);
+    // Without standard input, descriptor 0 is the first one a program opens: it must count as
+    // valid.
+    close(STDIN_FILENO);
     int rc = fn();
     fflush(nullptr);
     _exit(rc);
