@@ -24,13 +24,19 @@ export RB_TEST_WRAPPER=/usr/bin/valgrind
 export VALGRIND_OPTS="-q --error-exitcode=99 --leak-check=full
   --show-leak-kinds=definite,indirect,possible --errors-for-leak-kinds=definite,indirect,possible
   --suppressions=/proc/self/fd/4 --log-fd=3"
+# A filter that selects nothing fails, so that a renamed test cannot drop out unnoticed.
+run() {
+  if ! "$build_dir/$1" --gtest_list_tests --gtest_filter="$2" | grep -q '^ '; then
+    echo "valgrind: $1 has no test $2" >&2
+    return 1
+  fi
+  "$build_dir/$1" --gtest_brief=1 --gtest_filter="$2"
+}
 status=0
 {
-  "$build_dir/block_io_test" --gtest_brief=1 --gtest_filter='Arming.*' &&
-    "$build_dir/boot_cycle_test" --gtest_brief=1 \
-      --gtest_filter='BootEntry.*:AutoCycle.StateWordAndReadOutOfASmallChain' &&
-    "$build_dir/fstab_default_test" --gtest_brief=1 \
-      --gtest_filter='DefaultFstab.DeviceTreeTableMergedFirst'
+  run block_io_test 'Arming.*' &&
+    run boot_cycle_test 'BootEntry.*:AutoCycle.StateWordAndReadOutOfASmallChain' &&
+    run fstab_default_test 'DefaultFstab.TableChoiceAndDeviceTree'
 } 3>&2 4<tests/fault/valgrind.supp || status=1
 echo "valgrind: $((SECONDS - start)) s, $([ $status -eq 0 ] && echo "no errors" || echo FAILED)"
 exit "$status"
