@@ -1,6 +1,6 @@
 // Fault injection for tests/fault, preloaded (LD_PRELOAD): RB_FAULT=RULE[,RULE...] makes calls
 // fail or come up short, RULE = CALL[.TARGET]=ACTION with
-//   CALL    read, write, lseek (lseek64), fopen, fibmap (the FIBMAP ioctl)
+//   CALL    read, write, lseek (lseek64), fopen, flock, fibmap (the FIBMAP ioctl)
 //   TARGET  dev: a block device; data: a regular file under /data; misc: a path ending in
 //           "/misc" (fopen); none: every call
 //   ACTION  ERR%n: matching calls 1, n+1, 2n+1... fail with ERR; ERR#k: the k-th one fails;
@@ -18,6 +18,7 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -41,7 +42,8 @@ static int parse_rule(const char* text, struct rule* r) {
   }
   snprintf(call, sizeof(call), "|%s|", r->call);
   snprintf(target, sizeof(target), "|%s|", r->target);
-  if (!strstr("|read|write|lseek|fopen|fibmap|", call) || !strstr("||dev|data|misc|", target)) {
+  if (!strstr("|read|write|lseek|fopen|flock|fibmap|", call) ||
+      !strstr("||dev|data|misc|", target)) {
     return 0;
   }
   if (strcmp(action, "short") == 0) {
@@ -133,6 +135,11 @@ FILE* fopen(const char* path, const char* mode) {
   struct rule* r = fault("fopen", -1, path, -1);
   if (r != NULL) errno = r->error;
   return r != NULL ? NULL : REAL(fopen)(path, mode);
+}
+
+int flock(int fd, int operation) {
+  struct rule* r = fault("flock", fd, NULL, -1);
+  return r != NULL ? fail(r->error) : REAL(flock)(fd, operation);
 }
 
 int ioctl(int fd, unsigned long request, ...) {
