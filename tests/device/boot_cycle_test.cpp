@@ -62,6 +62,7 @@ TEST(BootEntry, RequestFileAndEnableFull) {
       {{"enable", "fullx"}, "disable", "DiSa", "DiSa", 1, near_miss},
       {{"enable", "full", "x"}, "disable", "DiSa", "DiSa", 1, near_miss},
       {{"enabl", "full"}, "disable", "DiSa", "DiSa", 1, near_miss},
+      {{"enablex", "full"}, "disable", "DiSa", "DiSa", 1, near_miss},
   };
   for (const auto& s : steps) {
     SCOPED_TRACE(s.args[0] + " " + s.args.back());
