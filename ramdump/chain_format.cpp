@@ -5,7 +5,7 @@
 
 #include "ramdump/le_bytes.h"
 
-void encode_chain_block_header(const chain_block_header& h, uint8_t out[16]) {
+void encode_chain_block_header(const chain_block_header& h, uint8_t out[CHAIN_BLOCK_HEADER_SIZE]) {
   put_le32(out, h.magic);
   put_le32(out + 4, h.next_block);
   put_le16(out + 8, h.reserved);
@@ -13,7 +13,7 @@ void encode_chain_block_header(const chain_block_header& h, uint8_t out[16]) {
   put_le32(out + 12, h.crc);
 }
 
-chain_block_header decode_chain_block_header(const uint8_t in[16]) {
+chain_block_header decode_chain_block_header(const uint8_t in[CHAIN_BLOCK_HEADER_SIZE]) {
   chain_block_header h;
   h.magic = get_le32(in);
   h.next_block = get_le32(in + 4);
@@ -23,7 +23,8 @@ chain_block_header decode_chain_block_header(const uint8_t in[16]) {
   return h;
 }
 
-void encode_initial_block_header(const initial_block_header& h, uint8_t out[24]) {
+void encode_initial_block_header(const initial_block_header& h,
+                                 uint8_t out[INITIAL_BLOCK_HEADER_SIZE]) {
   put_le32(out, h.magic);
   put_le32(out + 4, h.first_block);
   put_le32(out + 8, h.block_size);
@@ -32,7 +33,7 @@ void encode_initial_block_header(const initial_block_header& h, uint8_t out[24])
   put_le32(out + 20, h.state);
 }
 
-initial_block_header decode_initial_block_header(const uint8_t in[24]) {
+initial_block_header decode_initial_block_header(const uint8_t in[INITIAL_BLOCK_HEADER_SIZE]) {
   initial_block_header h;
   h.magic = get_le32(in);
   h.first_block = get_le32(in + 4);
@@ -43,14 +44,14 @@ initial_block_header decode_initial_block_header(const uint8_t in[24]) {
   return h;
 }
 
-void encode_dump_file_record(const dump_file_record& r, uint8_t out[40]) {
+void encode_dump_file_record(const dump_file_record& r, uint8_t out[DUMP_FILE_RECORD_SIZE]) {
   put_le32(out, r.magic);
   memcpy(out + 4, r.name, DUMP_FILE_NAME_SIZE);
   put_le64(out + 24, r.size);
   put_le64(out + 32, r.reserved);
 }
 
-dump_file_record decode_dump_file_record(const uint8_t in[40]) {
+dump_file_record decode_dump_file_record(const uint8_t in[DUMP_FILE_RECORD_SIZE]) {
   dump_file_record r;
   r.magic = get_le32(in);
   memcpy(r.name, in + 4, DUMP_FILE_NAME_SIZE);

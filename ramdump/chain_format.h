@@ -48,14 +48,15 @@ struct dump_file_record {
   uint64_t reserved;
 };
 
-void encode_chain_block_header(const chain_block_header& h, uint8_t out[16]);
-chain_block_header decode_chain_block_header(const uint8_t in[16]);
+void encode_chain_block_header(const chain_block_header& h, uint8_t out[CHAIN_BLOCK_HEADER_SIZE]);
+chain_block_header decode_chain_block_header(const uint8_t in[CHAIN_BLOCK_HEADER_SIZE]);
 
-void encode_initial_block_header(const initial_block_header& h, uint8_t out[24]);
-initial_block_header decode_initial_block_header(const uint8_t in[24]);
+void encode_initial_block_header(const initial_block_header& h,
+                                 uint8_t out[INITIAL_BLOCK_HEADER_SIZE]);
+initial_block_header decode_initial_block_header(const uint8_t in[INITIAL_BLOCK_HEADER_SIZE]);
 
-void encode_dump_file_record(const dump_file_record& r, uint8_t out[40]);
-dump_file_record decode_dump_file_record(const uint8_t in[40]);
+void encode_dump_file_record(const dump_file_record& r, uint8_t out[DUMP_FILE_RECORD_SIZE]);
+dump_file_record decode_dump_file_record(const uint8_t in[DUMP_FILE_RECORD_SIZE]);
 
 // The chain CRC of one block: zlib's crc32 continued from the previous block's CRC (the
 // initial CRC for the first block) over LE32(block) followed by LE32(next_block).
