@@ -1,12 +1,10 @@
 #include "tests/harness/fake_device.h"
 
 #include <fcntl.h>
-#include <linux/loop.h>
 #include <sched.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <string.h>
-#include <sys/ioctl.h>
 #include <sys/mount.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -27,32 +25,6 @@ namespace {
 
 void check(bool ok, const std::string& what) {
   if (!ok) throw std::runtime_error(what + ": " + strerror(errno));
-}
-
-// Attaches the image to a free loop device together with LO_FLAGS_AUTOCLEAR (LOOP_CONFIGURE), so
-// that the device detaches itself once nothing holds it. Returns an open descriptor of it, which
-// the caller closes once the file system is mounted, or -1.
-int attach_loop(const std::string& image, std::string* device) {
-  int control = open("/dev/loop-control", O_RDWR | O_CLOEXEC);
-  int image_fd = open(image.c_str(), O_RDWR | O_CLOEXEC);
-  int loop_fd = -1;
-  for (int attempt = 0; attempt < 20 && control >= 0 && image_fd >= 0 && loop_fd < 0; ++attempt) {
-    int n = ioctl(control, LOOP_CTL_GET_FREE);
-    if (n < 0) break;
-    *device = "/dev/loop" + std::to_string(n);
-    mknod(device->c_str(), S_IFBLK | 0660, makedev(7, n));  // missing in some containers
-    loop_config config = {};
-    config.fd = static_cast<uint32_t>(image_fd);
-    config.info.lo_flags = LO_FLAGS_AUTOCLEAR;
-    loop_fd = open(device->c_str(), O_RDWR | O_CLOEXEC);
-    if (loop_fd >= 0 && ioctl(loop_fd, LOOP_CONFIGURE, &config) != 0) {  // taken meanwhile
-      close(loop_fd);
-      loop_fd = -1;
-    }
-  }
-  if (image_fd >= 0) close(image_fd);
-  if (control >= 0) close(control);
-  return loop_fd;
 }
 
 }  // namespace
@@ -139,17 +111,16 @@ void FakeDevice::setup(const FakeDeviceConfig& config) {
     // No blocks reserved for root, so that free space is what statvfs reports as available.
     const std::string mkfs = "mkfs.ext4 -q -F -m 0 -b 4096 " + config.mkfs_options + " " + image;
     if (system((mkfs + " >/dev/null 2>&1").c_str()) != 0) throw std::runtime_error(mkfs);
-    int hold = attach_loop(image, &loop_device_);
-    check(hold >= 0, "attach a loop device");
-    int rc = mount(loop_device_.c_str(), host_path("/data").c_str(), "ext4", 0, "");
-    int mount_errno = errno;
-    close(hold);
-    fs::remove(image);  // the loop device keeps it; nothing is left behind if we are killed
-    errno = mount_errno;
-    check(rc == 0, "mount ext4 on " + loop_device_);
+    // mount(8) attaches a loop device that detaches itself once unmounted; the image is
+    // removed at once, so that nothing is left behind if we are killed.
+    const std::string data = host_path("/data");
+    if (system(("mount -o loop " + image + " " + data + " && rm " + image).c_str()) != 0) {
+      throw std::runtime_error("mount ext4 on a loop device");
+    }
     struct stat st;
-    check(stat(loop_device_.c_str(), &st) == 0 &&
-              mknod(host_path(USERDATA_DEVICE).c_str(), S_IFBLK | 0600, st.st_rdev) == 0,
+    check(stat(data.c_str(), &st) == 0, "stat /data");
+    loop_device_ = "/dev/loop" + std::to_string(minor(st.st_dev));
+    check(mknod(host_path(USERDATA_DEVICE).c_str(), S_IFBLK | 0600, st.st_dev) == 0,
           "userdata node");
   }
   fs::create_directories(host_path("/data/vendor/ramdump"));
