@@ -137,7 +137,8 @@ TEST(DefaultFstab, BootConfigAndBlockDevice) {
       printf("%s=%d:%s\n", key, found, found ? value.c_str() : "");
     }
     std::ofstream("/dt/compatible") << "android,firmware";  // its last byte is dropped unseen
-    printf("compatible=%d\n", is_dt_compatible());
+    std::string dt_only;
+    printf("compatible=%d one=%d\n", is_dt_compatible(), fs_mgr_get_boot_config("one", &dt_only));
     if (chroot("/tmp") != 0) return 1;  // without a kernel command line to read
     printf("no cmdline=%d:%s\n", fs_mgr_get_boot_config_from_kernel_cmdline("last", &value),
            value.c_str());
@@ -146,7 +147,7 @@ TEST(DefaultFstab, BootConfigAndBlockDevice) {
   EXPECT_EQ(r.status, 0) << r.err;
   EXPECT_EQ(r.out,
             "cmdline prop=0:unchanged\nmode=0:\nempty=1:\nbare=0:\none=1:\nzero=0:\nserial=1:\"x\n"
-            "last=1:z\ncompatible=0\nno cmdline=0:z\n");
+            "last=1:z\ncompatible=0 one=0\nno cmdline=0:z\n");
   for (const std::string state : {"encrypted", "encrypted "}) {
     device.set_property("ro.crypto.state", state);
     std::string found;
