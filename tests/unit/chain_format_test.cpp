@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "ramdump/arming.h"
@@ -92,15 +93,23 @@ TEST(ChainRecords, ByteLayout) {
       "F1LeRAMDUMP_MSG.txt\0\0\0\0\0\x08\x07\x06\x05\x04\x03\x02\x01\x80\x90\xA0\xB0\xC0\xD0\xE0\xF0"s);
 }
 
-// A file that ends early is no error: the bytes that came are kept. A failing read is.
-TEST(RetryIo, ShortReadAndReadError) {
-  FILE* f = tmpfile();
-  ASSERT_EQ(write_retry(fileno(f), "0123456789", 10), 0);
+// A read that comes in pieces goes on to its last byte; an early end is no error (the bytes
+// that came are kept); a failing read is.
+TEST(RetryIo, PiecesEarlyEndAndError) {
+  int pipe_fds[2];
+  ASSERT_EQ(pipe(pipe_fds), 0);
+  ASSERT_EQ(write_retry(pipe_fds[1], "012345678", 9), 0);
+  std::thread late([&] {
+    usleep(200000);
+    write_retry(pipe_fds[1], "9AB", 3);
+    close(pipe_fds[1]);
+  });
   std::string buf(32, 'x');
-  ASSERT_EQ(lseek(fileno(f), 0, SEEK_SET), 0);
-  EXPECT_EQ(read_retry(fileno(f), &buf[0], buf.size()), 0);
-  EXPECT_EQ(buf.substr(0, 11), "0123456789x");
-  fclose(f);
+  EXPECT_EQ(read_retry(pipe_fds[0], &buf[0], 10), 0);   // 9 bytes, then the last one
+  EXPECT_EQ(read_retry(pipe_fds[0], &buf[10], 22), 0);  // 2 bytes, then the end
+  late.join();
+  close(pipe_fds[0]);
+  EXPECT_EQ(buf.substr(0, 13), "0123456789ABx");
   EXPECT_EQ(read_retry(-1, &buf[0], buf.size()), -1);
 }
 
