@@ -67,8 +67,9 @@ class DumpExtract : public testing::Test {
   std::string dir_;
 };
 
-// `first` bytes of a record header end the first payload, `second` bytes of the next end the
-// second: the carry comes from the end of the unit as read, so only splits up to 16 come whole.
+// `first` bytes of a record header end the second payload, `second` bytes of the next end the
+// third: the carry comes from the end of the unit as read, so only splits up to 16 come whole.
+// The second unit starts inside content, so that a carry left in place shows.
 TEST_F(DumpExtract, RecordHeadersAcrossUnits) {
   const std::string msg = pattern(5000, 3);
   struct {
@@ -78,7 +79,7 @@ TEST_F(DumpExtract, RecordHeadersAcrossUnits) {
                {17, 0, false}, {0, 17, false}, {9, 39, false}};
   for (const auto& c : cases) {
     SCOPED_TRACE(testing::Message() << "split " << c.first << "/" << c.second);
-    const std::string stream = record("PMIC", pattern(kPayload - c.first - 40, 1)) +
+    const std::string stream = record("PMIC", pattern(2 * kPayload - c.first - 40, 1)) +
                                record("KLOG", pattern(kPayload + c.first - c.second - 40, 2)) +
                                record("RAMDUMP_MSG.txt", msg) + record("FW", "fw");
     std::string message;
