@@ -115,14 +115,18 @@ struct Fixture {
   }
   // A link at a name inside apq/00 that the run cannot remove: it is there when the output is
   // written, as if planted after the old output was deleted.
-  void pinned_link(const std::string& name, const std::string& regular = "") {
-    if (!regular.empty()) d.write_file(kOutDir + "/" + regular, "old");
-    link("/data/victim", kOutDir + "/" + name);
+  void pinned_link(const std::string& name, bool hard = false) {
+    if (name != "RAMDUMP_OUTPUT") d.write_file(kOutDir + "/RAMDUMP_OUTPUT", "old");
+    if (hard) {
+      fs::create_hard_link(d.host_path("/data/victim"), d.host_path(kOutDir + "/" + name));
+    } else {
+      link("/data/victim", kOutDir + "/" + name);
+    }
     shell("chattr +i " + d.host_path(kOutDir));
   }
-  void fifo(const std::string& path) {
+  void node(const std::string& path, mode_t type) {  // a FIFO or a socket
     d.remove(path);
-    ASSERT_EQ(mkfifo(d.host_path(path).c_str(), 0666), 0);
+    ASSERT_EQ(mknod(d.host_path(path).c_str(), type | 0666, 0), 0);
   }
 };
 
@@ -134,12 +138,15 @@ TEST(HostilePaths, NothingOutsideTheToolsFilesChanges) {
                     out = "failed to open outfile:" + kOutDir + "/RAMDUMP_OUTPUT for writing: ",
                     not_held = std::string(kOther) + " does not hold " + kReserved + "\\n\n",
                     no_dir = "Not a directory\\n\n",
-                    nxio = " for writing: No such device or address\\n\n";
+                    nxio = ": No such device or address\\n\n";
   using Plant = std::function<void(Fixture&)>;
   const auto link = [](std::string target, std::string path) -> Plant {
     return [=](Fixture& f) { f.link(target, path); };
   };
-  const auto fifo = [](std::string path) -> Plant { return [=](Fixture& f) { f.fifo(path); }; };
+  const auto node = [](std::string path, mode_t type) -> Plant {
+    return [=](Fixture& f) { f.node(path, type); };
+  };
+  const Plant fifo = node(kFifo, S_IFIFO);
   const Plant other = [](Fixture&f) { f.set_fstab(kOther); }, empty = [](Fixture&f) {
     f.set_fstab(kOther);
     f.d.write_file(kFifo, "");
@@ -161,9 +168,9 @@ TEST(HostilePaths, NothingOutsideTheToolsFilesChanges) {
          fs::create_hard_link(f.d.host_path("/data/victim"), f.d.host_path(kReserved));
        },
        boot, 255, kReserved + refused},
-      {fifo(kReserved), boot, 255, kReserved + refused},
+      {node(kReserved, S_IFIFO), boot, 255, kReserved + refused},
       {link("/data/absent", kStatus), boot, 0, kStatus + refused},
-      {fifo(kStatus), boot, 0, kStatus + refused},
+      {node(kStatus, S_IFIFO), boot, 0, kStatus + refused},
       // A linked ramdump directory is as good as missing: the feature is switched off.
       {[](Fixture& f) {
          fs::rename(f.d.host_path(kDir), f.d.host_path("/data/vendor/real"));
@@ -175,7 +182,9 @@ TEST(HostilePaths, NothingOutsideTheToolsFilesChanges) {
       // Links in place when the output and the message are written.
       {[](Fixture& f) { f.pinned_link("RAMDUMP_OUTPUT"); }, boot, 255,
        out + "Too many levels of symbolic links\\n\n"},
-      {[](Fixture& f) { f.pinned_link("RAMDUMP_MSG.txt", "RAMDUMP_OUTPUT"); }, boot, 0,
+      {[](Fixture& f) { f.pinned_link("RAMDUMP_MSG.txt"); }, boot, 0,
+       "Could not open file 'RAMDUMP_MSG.txt' for writing\n"},
+      {[](Fixture& f) { f.pinned_link("RAMDUMP_MSG.txt", true); }, boot, 0,
        "Could not open file 'RAMDUMP_MSG.txt' for writing\n"},
       // The mount table names the second file system's device: nothing is read, nor written into
       // it, and the dump stays in the reserved blocks. Without a block to read, the device is never
@@ -186,11 +195,12 @@ TEST(HostilePaths, NothingOutsideTheToolsFilesChanges) {
       {empty, test_fifo, 0, ""},
       {empty, read_fifo, 0, ""},
       // A person's paths are taken as typed, but no open waits for a FIFO's other end.
-      {fifo(kFifo), test_fifo, 0,
+      {fifo, test_fifo, 0,
        "Failed to get block 0 for file " + kFifo + ": Inappropriate ioctl for device\\n\n"},
-      {fifo(kFifo), read_fifo, 0, ""},
-      {fifo(kFifo), {"-r", kFifo, kReserved}, 255, "failed to open outfile:" + kFifo + nxio},
-      {fifo(kFifo), {"-c", "65536", kFifo}, 255, "failed to open file:" + kFifo + nxio},
+      {fifo, read_fifo, 0, ""},
+      {fifo, {"-r", kFifo, kReserved}, 255, "failed to open outfile:" + kFifo + " for writing" + nxio},
+      {fifo, {"-c", "65536", kFifo}, 255, "failed to open file:" + kFifo + " for writing" + nxio},
+      {node(kFifo, S_IFSOCK), test_fifo, 255, "failed to open " + kFifo + " for reading" + nxio},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE("row " + std::to_string(&row - rows));
@@ -273,9 +283,10 @@ TEST(HostilePaths, RunsOnTheReservedFileTakeTurns) {
   EXPECT_EQ(f.d.read_file(kOutDir + "/RAMDUMP_MSG.txt"), "watchdog timeout\n");
   EXPECT_EQ(stored_ibh(f.d), make_ibh(f.reserved[0], 4096, kCount, 0x5eed, 1));
   EXPECT_EQ(verify_chain(f.d, f.reserved, 0x5eed, false), "");
-  // Conversions take turns too, also when -c is about to create the file, and so do switches,
-  // which would otherwise leave the misc items disagreeing under a cycle.
-  for (const auto& args : {std::vector<std::string>{"-t", "-i", "5eed", kReserved},
+  // Conversions take turns too, through another name of the file or when -c is about to create
+  // it, and so do switches, which would otherwise leave the misc items disagreeing under a cycle.
+  f.link(kReserved, "/data/elsewhere/link");
+  for (const auto& args : {std::vector<std::string>{"-t", "-i", "5eed", "/data/elsewhere/link"},
                            {"-c", "65536", kDir + "../ramdump/RAMDUMP_RESERVED"},
                            {"-d"}}) {
     if (args[0] == "-c") f.d.remove(kReserved);
@@ -288,7 +299,7 @@ TEST(HostilePaths, RunsOnTheReservedFileTakeTurns) {
   r = held({"-a"}, [&] {
     fs::rename(f.d.host_path(kDir), f.d.host_path("/data/vendor/real"));
     fs::create_directories(f.d.host_path(kOutDir));
-    f.fifo(kOutDir + "/RAMDUMP_OUTPUT");
+    f.node(kOutDir + "/RAMDUMP_OUTPUT", S_IFIFO);
     shell("mkdir -p " + real_apq + " && chattr +i " + real_apq);
   });
   shell("chattr -i " + real_apq);
