@@ -1,18 +1,26 @@
-// ramdump_inspect list, extract and strip, run as built on read-outs made here, and its model
-// of the tool's message extraction against the real one.
+// The host tools run as built: ramdump_inspect on read-outs made here and on image files (a
+// sparse "device" armed by the tool's own chain writer, a misc image), firmware_sim's read-only
+// and placement options, and the inspector's model of the tool's message extraction against the
+// real one.
 #include <android/log.h>
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <filesystem>
+#include <fstream>
+#include <functional>
 #include <map>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "ramdump/arming.h"
+#include "ramdump/chain_format.h"
 #include "ramdump/dump_extract.h"
 #include "tests/harness/chain_checks.h"
 
@@ -21,6 +29,7 @@ namespace {
 namespace fs = std::filesystem;
 using Files = std::map<std::string, std::string>;
 constexpr size_t P = 4080;  // payload bytes of a unit
+constexpr uint32_t kCrc = 0x5eed1234;
 
 std::string pattern(size_t n, unsigned seed) {
   std::string s(n, '\0');
@@ -59,17 +68,32 @@ std::string records_json(const std::vector<Rec>& recs) {
   return "{\"records\": [" + out + (out.empty() ? "" : "\n") + "], \"end\": ";
 }
 
-class InspectStream : public testing::Test {
+// Writes bytes into a file at offset.
+void write_at(const std::string& path, size_t offset, const std::string& bytes) {
+  std::fstream(path, std::ios::in | std::ios::out | std::ios::binary).seekp(offset) << bytes;
+}
+
+// Whether the file holds exactly bytes, compared piece by piece as it is read (a copy of the
+// device image would take a second here).
+bool holds(const std::string& path, const std::string& bytes) {
+  std::ifstream in(path, std::ios::binary);
+  char piece[1 << 16];
+  size_t at = 0;
+  while (in.read(piece, sizeof(piece)).gcount() > 0 &&
+         bytes.compare(at, in.gcount(), piece, in.gcount()) == 0)
+    at += in.gcount();
+  return at == bytes.size() && in.gcount() == 0;
+}
+
+class HostTools : public testing::Test {
  protected:
   void TearDown() override { fs::remove_all(dir_); }
 
-  // The built ramdump_inspect, under RB_TEST_WRAPPER (an emulator) when it is set.
-  RunResult inspect(const std::string& args) {
+  // A program of the build with its arguments, under RB_TEST_WRAPPER (an emulator) when set.
+  RunResult run(const std::string& command) {
     const char* wrapper = getenv("RB_TEST_WRAPPER");
-    const int w = system((std::string(wrapper != nullptr ? wrapper : "") +
-                          " " RB_BUILD_DIR "/ramdump_inspect " + args + " >" + dir_ + "/out 2>" +
-                          dir_ + "/err")
-                             .c_str());
+    const std::string line = std::string(wrapper ? wrapper : "") + " " RB_BUILD_DIR "/" + command;
+    const int w = system((line + " >" + dir_ + "/out 2>" + dir_ + "/err").c_str());
     return {read_host_file(dir_ + "/out"), read_host_file(dir_ + "/err"),
             WIFEXITED(w) ? WEXITSTATUS(w) : -1};
   }
@@ -82,14 +106,57 @@ class InspectStream : public testing::Test {
     return out;
   }
 
-  std::string dir_ = testing::TempDir() + "readout_XXXXXX";
-  const std::string readout_ = (mkdtemp(dir_.data()), dir_ + "/RAMDUMP_OUTPUT"), x_ = dir_ + "/x";
+  // Blocks in two runs of 1024 and 476, then three short ones, armed into a sparse device image
+  // (kept in image_) with a misc image that names them, and the read-out.
+  void arm() {
+    for (int64_t b = 100; b < 1600; ++b) blocks_.push_back(b);
+    blocks_.insert(blocks_.end(), {2500, 1700, 1701, 1702, 3000});
+    const int fd = open(dev_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+    std::vector<uint8_t> buffer(MAX_RUN_BLOCKS * 4096, 0);
+    write_chain(fd, blocks_.data(), blocks_.size(), buffer.data(), 4096, kCrc, 0);
+    image_.assign(lseek(fd, 0, SEEK_END), '\0');
+    EXPECT_EQ(pread(fd, image_.data(), image_.size(), 0), static_cast<ssize_t>(image_.size()));
+    close(fd);
+    write_host_file(misc_, std::string(4096, '\0'));
+    write_at(misc_, 3184, make_ibh(100, 4096, blocks_.size(), kCrc, STATE_ARMED));
+    read_out();
+  }
+  // The read-out: the device's chain blocks in chain order.
+  void read_out() {
+    std::ifstream in(dev_, std::ios::binary);
+    std::string readout(blocks_.size() * 4096, '\0');
+    for (size_t i = 0; i < blocks_.size(); ++i)
+      in.seekg(blocks_[i] * 4096).read(&readout[i * 4096], 4096);
+    write_host_file(readout_, readout);
+  }
+  // Changes the header of chain block i in image_, on the device and in the read-out, and notes
+  // the former one in undo_; with fix, its CRC follows the change.
+  void patch(size_t i, const std::function<void(chain_block_header&)>& change, bool fix = false) {
+    auto at = [&](size_t k) { return reinterpret_cast<uint8_t*>(&image_[blocks_[k] * 4096]); };
+    undo_.emplace_back(i, decode_chain_block_header(at(i)));
+    chain_block_header h = undo_.back().second;
+    change(h);
+    if (fix) h.crc = chain_crc(decode_chain_block_header(at(i - 1)).crc, blocks_[i], h.next_block);
+    put(i, h);
+  }
+  void put(size_t i, const chain_block_header& h) {
+    encode_chain_block_header(h, reinterpret_cast<uint8_t*>(&image_[blocks_[i] * 4096]));
+    const std::string raw = image_.substr(blocks_[i] * 4096, CHAIN_BLOCK_HEADER_SIZE);
+    write_at(dev_, blocks_[i] * 4096, raw), write_at(readout_, i * 4096, raw);
+  }
+
+  std::string dir_ = testing::TempDir() + "host_tools_XXXXXX";
+  const std::string readout_ = (mkdtemp(dir_.data()), dir_ + "/RAMDUMP_OUTPUT"), x_ = dir_ + "/x",
+                    dev_ = dir_ + "/dev.img", misc_ = dir_ + "/misc.img";
+  std::vector<int64_t> blocks_;
+  std::string image_;                                        // the device image as written here
+  std::vector<std::pair<size_t, chain_block_header>> undo_;  // chain blocks and former headers
 };
 
 // Records across unit boundaries and read-outs that end badly: what list says and exits with,
 // what extract writes, and that list's model of the tool's message extraction agrees with the
 // real one.
-TEST_F(InspectStream, StreamsAndEndings) {
+TEST_F(HostTools, StreamsAndEndings) {
   __android_log_set_logger([](const __android_logger_data*, const char*) {});
   umask(022);
   struct Row {
@@ -133,10 +200,9 @@ TEST_F(InspectStream, StreamsAndEndings) {
   // clang-format on
   for (const Row& row : rows) {
     SCOPED_TRACE(row.err + " " + std::to_string(row.end));
-    const std::string readout =
-        row.readout.empty() ? readout_units(stream_of(row.recs)) : row.readout;
-    write_host_file(readout_, readout);
-    RunResult list = inspect("list --json " + readout_);
+    write_host_file(readout_,
+                    row.readout.empty() ? readout_units(stream_of(row.recs)) : row.readout);
+    RunResult list = run("ramdump_inspect list --json " + readout_);
     EXPECT_EQ(list.status, row.status);
     EXPECT_EQ(list.out.substr(0, list.out.find("\"detail\"")),
               records_json(row.recs) + "{\"offset\": " + std::to_string(row.end) +
@@ -145,7 +211,7 @@ TEST_F(InspectStream, StreamsAndEndings) {
     EXPECT_TRUE(contains(list.err + list.out, row.err)) << list.err;
 
     fs::remove_all(x_);
-    EXPECT_EQ(inspect("extract " + readout_ + " " + x_).status, row.status);
+    EXPECT_EQ(run("ramdump_inspect extract " + readout_ + " " + x_).status, row.status);
     EXPECT_EQ(fs::status(x_).permissions(), fs::perms(0755));  // made under the umask 022
     Files want;
     for (const Rec& r : row.recs) want[want.count(r.name) ? r.name + ".1" : r.name] = r.content;
@@ -163,7 +229,7 @@ TEST_F(InspectStream, StreamsAndEndings) {
 
 // Usage errors, inputs and outputs that are refused, names that are not safe file names or
 // repeat, and what extract does with what is already in DIR (x) and with NAME arguments.
-TEST_F(InspectStream, CommandsNamesAndTargets) {
+TEST_F(HostTools, CommandsNamesAndTargets) {
   const std::string readout =
       readout_units(stream_of({{"memory0.bin", "new"}, {"RAMDUMP_OUTPUT", "log"}}));
   write_host_file(readout_, readout);
@@ -172,7 +238,7 @@ TEST_F(InspectStream, CommandsNamesAndTargets) {
                     outside = d + "/outside";
   const std::pair<std::string, std::string> unsafe[] = {  // record name, file name
       {"kernel_log.bin", "kernel_log.bin"}, {"kernel_log.bin", "kernel_log.bin.1"}, {"../../escape", ".._.._escape"},
-      {"..", "record_123"}, {"", "record_164"}, {"ttyS0\x01log", "ttyS0_log"},
+      {"..", "record_123"}, {"", "record_164"}, {"ttyS0\x1flog", "ttyS0_log"},
       {"abcdefghijklmnopqrstuvw", "abcdefghijklmnopqrst_"}, {"kernel_log.bin.1", "kernel_log.bin.1.1"}, {"/", "_"}};
   std::vector<Rec> recs;
   Files safe;
@@ -184,7 +250,6 @@ TEST_F(InspectStream, CommandsNamesAndTargets) {
   write_host_file(outside, "keep");
   const Files log = {{"RAMDUMP_OUTPUT", "log"}}, old = {{"memory0.bin", "old"}, *log.begin()},
               both = {{"memory0.bin", "new"}, *log.begin()}, link = {{"memory0.bin", "keep"}, *log.begin()};
-  // clang-format on
   struct {
     char before;  // in x/memory0.bin: f a file, l a link to outside; d: x is a link to real
     std::string args, err;
@@ -192,7 +257,7 @@ TEST_F(InspectStream, CommandsNamesAndTargets) {
     std::vector<std::string> out = {};
     Files x = {};  // what x holds after
   } rows[] = {
-      // clang-format off
+      {' ', "", "no command given\nusage: ramdump_inspect COMMAND", 2},
       {' ', "list --help", "", 0, {"usage: ramdump_inspect list [--json] OUTPUT\n"}},
       {' ', "list --bogus " + r, "unknown option '--bogus'\nusage: ramdump_inspect list", 2},
       {' ', "extract " + r, "usage: ramdump_inspect extract", 2},
@@ -212,23 +277,24 @@ TEST_F(InspectStream, CommandsNamesAndTargets) {
       {' ', "extract " + r + " " + x_ + " RAMDUMP_OUTPUT", "", 0, {}, log},
       {' ', "extract " + r + " " + x_ + " trace.bin", "no record named \"trace.bin\"", 1},
       {' ', "extract " + names + " " + x_, "", 0, {"record_123: 1 bytes (the name \"..\" is not a safe file name)\n",
-       "kernel_log.bin.1.1: 1 bytes (\"kernel_log.bin.1\" is taken)\n"}, safe},
+       "kernel_log.bin.1.1: 1 bytes (\"kernel_log.bin.1\" is taken)\n",
+       "ttyS0_log: 1 bytes (the name \"ttyS0\\x1flog\" is not a safe file name)\n"}, safe},
       {' ', "list --json " + names, "", 0, {
        "\"kernel_log.bin\", \"size\": 1, \"offset\": 41, \"complete\": true, \"notes\": [\"repeated name\"]}",
-       "\"ttyS0\\u0001log\", \"size\": 1, \"offset\": 205, \"complete\": true, \"notes\": [\"unsafe file name\"]}",
+       "\"ttyS0\\u001flog\", \"size\": 1, \"offset\": 205, \"complete\": true, \"notes\": [\"unsafe file name\"]}",
        "\"abcdefghijklmnopqrst\", \"size\": 1, \"offset\": 246, \"complete\": true, \"notes\": [\"no terminator\"]}"}},
       {' ', "list " + split, "", 0, {"the tool's extraction stops at stream offset 4063, without RAMDUMP_MSG.txt\n"}},
-      {' ', "list " + names, "", 0, {"         164                    1    [unsafe file name]\n",
+      {' ', "list " + names, "", 0, {"NAME\n           0 ", "         164                    1    [unsafe file name]\n",
        "end of the stream at offset 369: record magic"}},
-      // clang-format on
   };
+  // clang-format on
   for (const auto& row : rows) {
     SCOPED_TRACE(row.args + " " + row.before);
     fs::remove_all(x_), fs::remove_all(real), fs::create_directories(real);
     row.before == 'd' ? fs::create_symlink(real, x_) : void(fs::create_directories(x_));
     if (row.before == 'f') write_host_file(x_ + "/memory0.bin", "old");
     if (row.before == 'l') fs::create_symlink(outside, x_ + "/memory0.bin");
-    RunResult result = inspect(row.args);
+    RunResult result = run("ramdump_inspect " + row.args);
     EXPECT_EQ(result.status, row.status);
     for (const auto& text : row.out) EXPECT_TRUE(contains(result.out, text)) << result.out;
     EXPECT_TRUE(row.err.empty() ? result.err.empty() : contains(result.err, row.err)) << result.err;
@@ -237,6 +303,91 @@ TEST_F(InspectStream, CommandsNamesAndTargets) {
   }
   EXPECT_TRUE(files(real).empty() && read_host_file(outside) == "keep");
   EXPECT_TRUE(read_host_file(readout_) == readout);
+}
+
+// ramdump_inspect verify and misc, and firmware_sim --verify-only, on a chain and misc image
+// damaged in one place each; none of them changes either image.
+TEST_F(HostTools, VerifyMiscAndFirmwareSim) {
+  arm();
+  const std::string misc_image = read_host_file(misc_);
+  // clang-format off
+  auto items = [&](std::string flag, std::string ibh, std::string lba) {
+    return [=] { write_at(misc_, 3216, flag), write_at(misc_, 3184, ibh), write_at(misc_, 3136, lba); };
+  };
+  auto ibh = [&](uint32_t count, uint32_t crc) { return items("", make_ibh(100, 4096, count, crc, 1), ""); };
+  auto crc = [](chain_block_header& h) { h.crc ^= 1; };
+  const std::string verify = "ramdump_inspect verify ", out = " " + readout_, misc_text = "ramdump_inspect misc " + misc_,
+                    on_device = verify + "--device " + dev_ + " --misc " + misc_, stores = verify + "--misc " + misc_ + out;
+  const auto state = items("disa", make_ibh(0x1234, 4096, 99, 0xabc, 0x13), "\x10\0\0\0");
+  struct { std::function<void()> damage; std::string command; int status; std::vector<std::string> expected; } rows[] = {
+      {nullptr, verify + out, 0, {"blocks: 1505\nruns: 5, longest 1024\n"
+       "run lengths: 1: 2, 2-3: 1, 256-511: 1, 1024: 1\nchain block 0: CRC not checked", "result: good\n"}},
+      {nullptr, verify + "--first-block 0100 --initial-crc 5eed1234" + out, 0, {"result: good\n"}},
+      {nullptr, verify + "--first-block 0x65 --initial-crc 5eed1234" + out, 1,
+       {"first bad block: chain block 0 (block 101): bad CRC"}},
+      {ibh(1505, 7), stores, 1, {"chain block 0 (block 100): bad CRC"}},
+      {[&] { patch(500, crc); }, verify + "--json" + out, 1, {"\"blocks\": 1505, \"runs\": 5, \"longest_run\": 1024, "
+       "\"run_lengths\": {\"1\": 2, \"2-3\": 1, \"256-511\": 1, \"1024\": 1}, \"block0_checked\": false, \"ok\": false, "
+       "\"first_bad\": {\"chain_block\": 500, \"block\": 600, \"reason\": \"bad CRC"}},
+      {[&] { patch(1502, [](auto& h) { h.magic = 0; }); }, verify + out, 1,
+       {"chain block 1502 (block 1701): bad magic 00000000"}},
+      {[&] { patch(700, [](auto& h) { ++h.run_remaining; }); }, verify + out, 1,
+       {"chain block 700 (block 800): run_remaining 325 inside a run, expected 324"}},
+      {[&] { patch(1500, [](auto& h) { h.run_remaining = 2; }); }, verify + out, 1,
+       {"chain block 1500 (block 2500): run_remaining 2, but next_block 1700 is not block 2500 + 1"}},
+      {[&] { patch(1504, [](auto& h) { h.next_block = 77; }, true); }, verify + out, 1,
+       {"chain block 1504 (block 3000): the chain does not end: next_block 77"}},
+      {[&] { patch(1023, [](auto& h) { h.next_block = 0; }, true); }, verify + out, 1,
+       {"chain block 1023 (block 1123): next_block 0 ends the chain, but more"}},
+      {ibh(1506, kCrc), stores, 1, {"1505 blocks, but the stored header counts 1506"}},
+      {nullptr, on_device, 0, {"device: ", "blocks: 1505\n", "result: good\n"}},
+      {[&] { patch(1200, crc); }, on_device, 1, {"blocks: 1200\n", "chain block 1200 (block 1300): bad CRC"}},
+      {[&] { patch(1504, [](auto& h) { h.next_block = 1700; }, true); }, on_device, 1,
+       {"chain goes on past its 1505 blocks (to block 1700)"}},
+      {ibh(1506, kCrc), on_device, 1, {"chain ends after 1505 of 1506 blocks"}},
+      {items("", "BHdx" + make_ibh(1, 2, 3, 4, 0).substr(4), ""), on_device, 1,
+       {"its magic is not \"BHdr\": it names no chain"}},
+      {items("DiSa", std::string(24, '\0'), "\xff\xff\xff\xff"), misc_text, 0, {"\"DiSa\": disabled\n",
+       "24 zero bytes: the disabled form, it names no chain", "block address (offset 3136): ffffffff: the disable",
+       "unused item (offset 3160, left alone by the tool): 00 00 00 00\n"}},
+      {state, misc_text, 0, {": enabled\n", "first block  4660\n", "initial CRC  00000abc\n",
+       "state        00000013: armed, dump present, other bits 00000010\n", "00000010: a block address, not"}},
+      {state, "ramdump_inspect misc --json " + misc_, 0, {"\"names_chain\": true, \"no_chain_reason\": null,",
+       "\"state\": 19, \"state_bits\": [\"armed\",\"dump present\",\"other bits 00000010\"]},\n"}},
+      {[&] { ASSERT_EQ(truncate(misc_.c_str(), 3219), 0); }, misc_text, 1, {"too short: the misc items end at byte 3220\n"}},
+      {nullptr, "firmware_sim --verify-only " + misc_ + " " + dev_, 0,
+       {"chain: 1505 blocks from block 100 verified (initial CRC 5eed1234)\n"}},
+      {nullptr, "firmware_sim --first-record-at 39 " + misc_ + " " + dev_, 2, {"takes 0 or a number of at least 40\n"}},
+  };
+  // clang-format on
+  for (const auto& row : rows) {
+    if (row.damage) row.damage();
+    const std::string misc = read_host_file(misc_);
+    RunResult r = run(row.command);
+    EXPECT_EQ(r.status, row.status) << row.command << "\n" << r.out << r.err;
+    for (const auto& text : row.expected)
+      EXPECT_TRUE(contains(r.out + r.err, text)) << row.command << r.out << r.err;
+    EXPECT_TRUE(holds(dev_, image_) && holds(misc_, misc)) << row.command;
+    for (const auto& [i, h] : undo_) put(i, h);
+    undo_.clear(), write_host_file(misc_, misc_image);
+  }
+}
+
+// A filler record that puts the file's record header at each offset, which splits it another way
+// across the first two payloads.
+TEST_F(HostTools, FirmwareSimFirstRecordAt) {
+  const std::string content(5000, 'm');
+  write_host_file(dir_ + "/memory0.bin", content);
+  arm();
+  for (uint64_t at : {4079u, 4060u, 40u}) {  // 1, 20 and 4040 bytes before the end
+    const std::string filler = " --first-record-at " + std::to_string(at) + " " + misc_ + " ";
+    ASSERT_EQ(run("firmware_sim" + filler + dev_ + " " + dir_ + "/memory0.bin").status, 0);
+    read_out(), fs::remove_all(x_);
+    EXPECT_EQ(run("ramdump_inspect extract " + readout_ + " " + x_).status, 0) << at;
+    const Files want = {{"filler.bin", std::string(at - 40, '\0')}, {"memory0.bin", content}};
+    EXPECT_EQ(files(x_), want);
+    EXPECT_EQ(le32_at(read_host_file(misc_), 3184 + 20), STATE_ARMED | STATE_DUMP_PRESENT);
+  }
 }
 
 }  // namespace
