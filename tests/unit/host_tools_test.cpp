@@ -1,7 +1,5 @@
-// The host tools run as built: ramdump_inspect on read-outs made here and on image files (a
-// sparse "device" armed by the tool's own chain writer, a misc image), firmware_sim's read-only
-// and placement options, and the inspector's model of the tool's message extraction against the
-// real one.
+// The host tools run as built on read-outs and images made here: ramdump_inspect, firmware_sim's
+// options, and the inspector's model of the tool's message extraction against the real one.
 #include <android/log.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -121,13 +119,14 @@ class HostTools : public testing::Test {
     write_at(misc_, 3184, make_ibh(100, 4096, blocks_.size(), kCrc, STATE_ARMED));
     read_out();
   }
-  // The read-out: the device's chain blocks in chain order.
-  void read_out() {
+  // The read-out, written and returned: the device's chain blocks in chain order.
+  std::string read_out() {
     std::ifstream in(dev_, std::ios::binary);
     std::string readout(blocks_.size() * 4096, '\0');
     for (size_t i = 0; i < blocks_.size(); ++i)
       in.seekg(blocks_[i] * 4096).read(&readout[i * 4096], 4096);
     write_host_file(readout_, readout);
+    return readout;
   }
   // Changes the header of chain block i in image_, on the device and in the read-out, and notes
   // the former one in undo_; with fix, its CRC follows the change.
@@ -159,19 +158,13 @@ class HostTools : public testing::Test {
 TEST_F(HostTools, StreamsAndEndings) {
   __android_log_set_logger([](const __android_logger_data*, const char*) {});
   umask(022);
-  struct Row {
-    std::vector<Rec> recs;
-    std::string readout, err;  // readout: "" for the records' own; err: in list's error or detail
-    uint64_t end;
-    const char* reason;
-    int status;
-    bool message;  // the tool writes RAMDUMP_MSG.txt whole
-  };
+  // clang-format off
+  // readout: "" for the records' own; err: in list's error or detail; message: the tool writes RAMDUMP_MSG.txt whole.
+  struct Row { std::vector<Rec> recs; std::string readout, err; uint64_t end; const char* reason; int status; bool message; };
   const std::string msg = pattern(2 * P + 9, 9), k = "k" + std::string(P - 81, '\0');
   std::vector<Row> rows;
   // The message header d bytes before a unit's end: each edge of the classes 0-16, 17-39 (which
   // the tool reassembles wrongly) and 40+, and a cut magic.
-  // clang-format off
   for (size_t d : {0, 2, 16, 17, 39, 40, 45})
     rows.push_back({{{"memory0.bin", pattern(P - d - 40, 1)}, {"RAMDUMP_MSG.txt", msg}}, "", "",
                     P - d + 40 + msg.size(), "bad_magic", 0, d < 17 || d > 39});
@@ -197,6 +190,16 @@ TEST_F(HostTools, StreamsAndEndings) {
        4080, "bad_chain_magic", 1, false},
       {{{"memory0.bin", pattern(P - 60, 8)}}, readout_units(head), "inside a record header at stream offset 4060",
        4060, "cut_header", 1, false}});
+  // firmware_sim's filler record puts the next record's header 1, 20 and 4040 bytes before a unit's end.
+  write_host_file(dir_ + "/memory0.bin", std::string(5000, 'm'));
+  arm();
+  for (uint64_t at : {4079u, 4060u, 40u}) {
+    const std::string filler = " --first-record-at " + std::to_string(at) + " " + misc_ + " ";
+    ASSERT_EQ(run("firmware_sim" + filler + dev_ + " " + dir_ + "/memory0.bin").status, 0);
+    rows.push_back({{{"filler.bin", std::string(at - 40, '\0')}, {"memory0.bin", std::string(5000, 'm')}}, read_out(), "",
+                    at + 5040, "bad_magic", 0, false});
+  }
+  EXPECT_EQ(le32_at(read_host_file(misc_), 3184 + 20), STATE_ARMED | STATE_DUMP_PRESENT);
   // clang-format on
   for (const Row& row : rows) {
     SCOPED_TRACE(row.err + " " + std::to_string(row.end));
@@ -217,12 +220,10 @@ TEST_F(HostTools, StreamsAndEndings) {
     for (const Rec& r : row.recs) want[want.count(r.name) ? r.name + ".1" : r.name] = r.content;
     EXPECT_EQ(files(x_), want);
 
-    // The tool's own extraction.
-    fs::remove_all(x_), fs::create_directories(x_);
-    reset_dump_filter_state_for_test();
-    extract_ramdump_msg(readout_.c_str(), x_.c_str());
-    EXPECT_EQ(read_host_file(x_ + "/RAMDUMP_MSG.txt") == want["RAMDUMP_MSG.txt"] &&
-                  fs::exists(x_ + "/RAMDUMP_MSG.txt"),
+    fs::remove_all(x_), fs::create_directories(x_), reset_dump_filter_state_for_test();
+    extract_ramdump_msg(readout_.c_str(), x_.c_str());  // the tool's own extraction
+    const std::string message = x_ + "/RAMDUMP_MSG.txt";
+    EXPECT_EQ(fs::exists(message) && read_host_file(message) == want["RAMDUMP_MSG.txt"],
               row.message);
   }
 }
@@ -230,10 +231,9 @@ TEST_F(HostTools, StreamsAndEndings) {
 // Usage errors, inputs and outputs that are refused, names that are not safe file names or
 // repeat, and what extract does with what is already in DIR (x) and with NAME arguments.
 TEST_F(HostTools, CommandsNamesAndTargets) {
-  const std::string readout =
-      readout_units(stream_of({{"memory0.bin", "new"}, {"RAMDUMP_OUTPUT", "log"}}));
-  write_host_file(readout_, readout);
   // clang-format off
+  const std::string readout = readout_units(stream_of({{"memory0.bin", "new"}, {"RAMDUMP_OUTPUT", "log"}}));
+  write_host_file(readout_, readout);
   const std::string &r = readout_, &d = dir_, names = d + "/names", split = d + "/split", real = d + "/real",
                     outside = d + "/outside";
   const std::pair<std::string, std::string> unsafe[] = {  // record name, file name
@@ -250,13 +250,8 @@ TEST_F(HostTools, CommandsNamesAndTargets) {
   write_host_file(outside, "keep");
   const Files log = {{"RAMDUMP_OUTPUT", "log"}}, old = {{"memory0.bin", "old"}, *log.begin()},
               both = {{"memory0.bin", "new"}, *log.begin()}, link = {{"memory0.bin", "keep"}, *log.begin()};
-  struct {
-    char before;  // in x/memory0.bin: f a file, l a link to outside; d: x is a link to real
-    std::string args, err;
-    int status;
-    std::vector<std::string> out = {};
-    Files x = {};  // what x holds after
-  } rows[] = {
+  // before: in x/memory0.bin f a file, l a link to outside; d: x is a link to real. x: what x holds after.
+  struct { char before; std::string args, err; int status; std::vector<std::string> out = {}; Files x = {}; } rows[] = {
       {' ', "", "no command given\nusage: ramdump_inspect COMMAND", 2},
       {' ', "list --help", "", 0, {"usage: ramdump_inspect list [--json] OUTPUT\n"}},
       {' ', "list --bogus " + r, "unknown option '--bogus'\nusage: ramdump_inspect list", 2},
@@ -301,8 +296,8 @@ TEST_F(HostTools, CommandsNamesAndTargets) {
     EXPECT_TRUE(row.status != 1 || std::count(result.err.begin(), result.err.end(), '\n') == 1);
     EXPECT_EQ(files(x_), row.x);
   }
-  EXPECT_TRUE(files(real).empty() && read_host_file(outside) == "keep");
-  EXPECT_TRUE(read_host_file(readout_) == readout);
+  EXPECT_TRUE(files(real).empty() && read_host_file(outside) == "keep" &&
+              read_host_file(readout_) == readout);
 }
 
 // ramdump_inspect verify and misc, and firmware_sim --verify-only, on a chain and misc image
@@ -370,23 +365,6 @@ TEST_F(HostTools, VerifyMiscAndFirmwareSim) {
     EXPECT_TRUE(holds(dev_, image_) && holds(misc_, misc)) << row.command;
     for (const auto& [i, h] : undo_) put(i, h);
     undo_.clear(), write_host_file(misc_, misc_image);
-  }
-}
-
-// A filler record that puts the file's record header at each offset, which splits it another way
-// across the first two payloads.
-TEST_F(HostTools, FirmwareSimFirstRecordAt) {
-  const std::string content(5000, 'm');
-  write_host_file(dir_ + "/memory0.bin", content);
-  arm();
-  for (uint64_t at : {4079u, 4060u, 40u}) {  // 1, 20 and 4040 bytes before the end
-    const std::string filler = " --first-record-at " + std::to_string(at) + " " + misc_ + " ";
-    ASSERT_EQ(run("firmware_sim" + filler + dev_ + " " + dir_ + "/memory0.bin").status, 0);
-    read_out(), fs::remove_all(x_);
-    EXPECT_EQ(run("ramdump_inspect extract " + readout_ + " " + x_).status, 0) << at;
-    const Files want = {{"filler.bin", std::string(at - 40, '\0')}, {"memory0.bin", content}};
-    EXPECT_EQ(files(x_), want);
-    EXPECT_EQ(le32_at(read_host_file(misc_), 3184 + 20), STATE_ARMED | STATE_DUMP_PRESENT);
   }
 }
 
