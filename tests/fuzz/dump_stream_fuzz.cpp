@@ -1,12 +1,8 @@
-// The dump stream filter and the message extraction. The first byte chooses the mode:
-//   even: the input after three bytes is a dump stream fed to the filter in pieces (their size
-//         from bytes 1 and 2), the unused end of each call presented again in front of the
-//         next piece, as the filter's contract asks;
-//   odd:  the input after one byte is a dump stream cut into payloads behind chain block
-//         headers, as a read-out holds it, and extracted from that file; bit 1 pads the last
-//         unit to a whole one.
-// Whatever the record names say, nothing but the message file may appear, and only in the
-// output directory.
+// The dump stream filter and the message extraction. Byte 0 even: the stream after byte 2 is fed
+// to the filter in pieces (their size from bytes 1 and 2), the unused end of each call presented
+// again in front of the next piece, as the filter's contract asks. Odd: the stream after byte 0
+// is cut into a read-out (bit 1 pads the last unit) and extracted from it. Whatever the record
+// names say, nothing but the message file may appear, and only in the output directory.
 #include "tests/fuzz/fuzz_common.h"
 
 namespace {
