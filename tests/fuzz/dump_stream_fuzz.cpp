@@ -41,7 +41,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (size < 3) return 0;
   reset_dump_filter_state_for_test();
   if ((data[0] & 1) != 0) {
-    fuzz_extract(fuzz_readout(data + 1, size - 1, (data[0] & 2) != 0), out_dir);
+    fuzz_extract(data + 1, size - 1, (data[0] & 2) != 0, out_dir);
   } else {
     feed(data + 3, size - 3, 1 + ((data[1] | data[2] << 8) & 0x1FFF));
   }

@@ -35,9 +35,11 @@ inline std::string fuzz_scratch_dir() {
   return dir;
 }
 
-// The stream as a read-out holds it: payloads of 4080 bytes, each behind a chain block header
-// ("BCho", the rest zero); with pad, the last unit padded to a whole one.
-inline std::string fuzz_readout(const uint8_t* data, size_t size, bool pad) {
+// The tool's message extraction into dir from a read-out held in memory, which is returned: the
+// stream in payloads of 4080 bytes, each behind a chain block header ("BCho", the rest zero);
+// with pad, the last unit padded to a whole one.
+inline std::string fuzz_extract(const uint8_t* data, size_t size, bool pad,
+                                const std::string& dir) {
   const std::string stream(reinterpret_cast<const char*>(data), size);
   std::string readout;
   for (size_t at = 0; at < size; at += 4096 - CHAIN_BLOCK_HEADER_SIZE) {
@@ -45,15 +47,11 @@ inline std::string fuzz_readout(const uint8_t* data, size_t size, bool pad) {
                stream.substr(at, 4096 - CHAIN_BLOCK_HEADER_SIZE);
     if (pad) readout.resize((readout.size() + 4095) / 4096 * 4096, '\0');
   }
-  return readout;
-}
-
-// The tool's message extraction from a read-out held in memory, into dir.
-inline void fuzz_extract(const std::string& readout, const std::string& dir) {
   const int fd = memfd_create("readout", MFD_CLOEXEC);
   if (write(fd, readout.data(), readout.size()) != static_cast<ssize_t>(readout.size())) abort();
   extract_ramdump_msg(("/proc/self/fd/" + std::to_string(fd)).c_str(), dir.c_str());
   close(fd);
+  return readout;
 }
 
 // Whether the bytes may hold a "reservedsize=" or "zramsize=" value whose size overflows 64

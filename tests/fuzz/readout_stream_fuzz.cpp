@@ -25,14 +25,13 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (size < 3) return 0;
-  const std::string readout = fuzz_readout(data + 3, size - 3, (data[0] & 1) != 0);
+  reset_dump_filter_state_for_test();
+  found = false;
+  const std::string readout = fuzz_extract(data + 3, size - 3, (data[0] & 1) != 0, base_dir);
   device_extraction device;
   device_extraction_init(&device);
   for (size_t at = 0; at + UNIT_SIZE <= readout.size(); at += UNIT_SIZE)
     device_extraction_feed(&device, reinterpret_cast<const uint8_t*>(readout.data() + at));
-  reset_dump_filter_state_for_test();
-  found = false;
-  fuzz_extract(readout, base_dir);
   struct stat st;
   if (device.message_complete != (found && stat(message.c_str(), &st) == 0 &&
                                   static_cast<unsigned long long>(st.st_size) == found_size))
