@@ -7,13 +7,13 @@ set -euo pipefail
 cd "$(dirname "$0")/.."
 source scripts/install_missing.sh
 seconds=${RB_FUZZ_SECONDS:-60}
+targets=(fstab_text_fuzz option_list_fuzz cmdline_fuzz dump_stream_fuzz readout_stream_fuzz)
 
 install_missing clang-14 libclang-rt-14-dev
 start=$SECONDS
 CC=clang-14 CXX=clang++-14 cmake -S . -B build-fuzz -DCMAKE_BUILD_TYPE=RelWithDebInfo \
   -DRB_FUZZ=ON >/dev/null
-cmake --build build-fuzz -j"$(nproc)" --target fstab_text_fuzz option_list_fuzz cmdline_fuzz \
-  dump_stream_fuzz readout_stream_fuzz >/dev/null
+cmake --build build-fuzz -j"$(nproc)" --target "${targets[@]}" >/dev/null
 echo "fuzz build: $((SECONDS - start)) s"
 
 # Fuzzes one target in a directory of this run (kept when something failed) and reports.
@@ -35,7 +35,7 @@ fuzz_one() {
 }
 
 pids=()
-for target in fstab_text_fuzz option_list_fuzz cmdline_fuzz dump_stream_fuzz readout_stream_fuzz; do
+for target in "${targets[@]}"; do
   fuzz_one "$target" >"$runs/$target.report" &
   pids+=($!)
 done

@@ -1,8 +1,4 @@
 // The kernel command line lookup. The input is the key, a line feed, then the command line.
-#include <stdlib.h>
-
-#include <string>
-
 #include "fs_mgr/fs_mgr_boot_config.h"
 #include "tests/fuzz/fuzz_common.h"
 

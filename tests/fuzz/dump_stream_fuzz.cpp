@@ -1,27 +1,13 @@
-// The dump stream filter and the message extraction. The first byte chooses the mode:
-//   even: the input after three bytes is a dump stream fed to the filter in pieces (their size
-//         from bytes 1 and 2), the unused end of each call presented again in front of the
-//         next piece, as the filter's contract asks;
-//   odd:  the input after one byte is a dump stream cut into payloads behind chain block
-//         headers, as a read-out holds it, and extracted from that file; bit 1 pads the last
-//         unit to a whole one.
-// Whatever the record names say, nothing but the message file may appear, and only in the
-// output directory.
-#include <stdlib.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <filesystem>
-#include <string>
-
-#include "ramdump/chain_format.h"
-#include "ramdump/dump_extract.h"
+// The dump stream filter and the message extraction. Byte 0 even: the stream after byte 2 is fed
+// to the filter in pieces (their size from bytes 1 and 2), the unused end of each call presented
+// again in front of the next piece, as the filter's contract asks. Odd: the stream after byte 0
+// is cut into a read-out (bit 1 pads the last unit) and extracted from it. Whatever the record
+// names say, nothing but the message file may appear, and only in the output directory.
 #include "tests/fuzz/fuzz_common.h"
 
 namespace {
 
 constexpr char kWanted[] = "RAMDUMP_MSG.txt";
-constexpr size_t kPayload = 4096 - CHAIN_BLOCK_HEADER_SIZE;
 std::string base_dir, out_dir, message;  // base_dir holds out_dir alone
 
 void feed(const uint8_t* data, size_t size, size_t piece) {
@@ -41,19 +27,6 @@ void feed(const uint8_t* data, size_t size, size_t piece) {
   if (out != nullptr) fclose(out);
 }
 
-void extract(const uint8_t* data, size_t size, bool pad_last) {
-  uint8_t header[CHAIN_BLOCK_HEADER_SIZE];
-  encode_chain_block_header({CHAIN_BLOCK_MAGIC, 0, 0, 1, 0}, header);
-  std::string readout;
-  for (size_t at = 0; at < size; at += kPayload) {
-    const size_t n = size - at < kPayload ? size - at : kPayload;
-    readout.append(reinterpret_cast<const char*>(header), sizeof(header));
-    readout.append(reinterpret_cast<const char*>(data + at), n);
-    if (pad_last) readout.append(kPayload - n, '\0');
-  }
-  fuzz_extract(readout, out_dir);
-}
-
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
@@ -68,7 +41,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (size < 3) return 0;
   reset_dump_filter_state_for_test();
   if ((data[0] & 1) != 0) {
-    extract(data + 1, size - 1, (data[0] & 2) != 0);
+    fuzz_extract(data + 1, size - 1, (data[0] & 2) != 0, out_dir);
   } else {
     feed(data + 3, size - 3, 1 + ((data[1] | data[2] << 8) & 0x1FFF));
   }

@@ -1,8 +1,4 @@
 // The mount table text parser on a memory stream, as the device-tree table reaches it.
-#include <stdio.h>
-#include <stdlib.h>
-#include <string.h>
-
 #include <vector>
 
 #include "fs_mgr/fs_mgr_fstab.h"

@@ -1,18 +1,22 @@
-// Shared by the fuzz targets: quiet logging, a scratch directory, the extraction from a read-out
-// in memory, and the option values that end the process on purpose.
+// Shared by the fuzz targets, with the headers they have in common: quiet logging, a scratch
+// directory, read-outs made and extracted in memory, and the option values that end the process
+// on purpose.
 #pragma once
 
 #include <android-base/logging.h>
 #include <android/log.h>
 #include <stdint.h>
+#include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/mman.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
 #include <string>
 
+#include "ramdump/chain_format.h"
 #include "ramdump/dump_extract.h"
 
 // Messages are still formatted (INFO is the tool's minimum severity) but go nowhere. Returns 0,
@@ -31,12 +35,23 @@ inline std::string fuzz_scratch_dir() {
   return dir;
 }
 
-// The tool's message extraction from a read-out held in memory, into dir.
-inline void fuzz_extract(const std::string& readout, const std::string& dir) {
+// The tool's message extraction into dir from a read-out held in memory, which is returned: the
+// stream in payloads of 4080 bytes, each behind a chain block header ("BCho", the rest zero);
+// with pad, the last unit padded to a whole one.
+inline std::string fuzz_extract(const uint8_t* data, size_t size, bool pad,
+                                const std::string& dir) {
+  const std::string stream(reinterpret_cast<const char*>(data), size);
+  std::string readout;
+  for (size_t at = 0; at < size; at += 4096 - CHAIN_BLOCK_HEADER_SIZE) {
+    readout += "BCho" + std::string(CHAIN_BLOCK_HEADER_SIZE - 4, '\0') +
+               stream.substr(at, 4096 - CHAIN_BLOCK_HEADER_SIZE);
+    if (pad) readout.resize((readout.size() + 4095) / 4096 * 4096, '\0');
+  }
   const int fd = memfd_create("readout", MFD_CLOEXEC);
   if (write(fd, readout.data(), readout.size()) != static_cast<ssize_t>(readout.size())) abort();
   extract_ramdump_msg(("/proc/self/fd/" + std::to_string(fd)).c_str(), dir.c_str());
   close(fd);
+  return readout;
 }
 
 // Whether the bytes may hold a "reservedsize=" or "zramsize=" value whose size overflows 64

@@ -1,8 +1,5 @@
 // The option lists of both option columns. The first byte chooses the column and, for the
 // mount options, the size of the buffer that collects the options it does not know.
-#include <stdlib.h>
-#include <string.h>
-
 #include "fs_mgr/fs_mgr_fstab.h"
 #include "tests/fuzz/fuzz_common.h"
 

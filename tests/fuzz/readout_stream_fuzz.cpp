@@ -2,11 +2,6 @@
 // pads the last unit to a whole one, bytes 1 and 2 are unused, the rest is a dump stream. Cut into
 // units, the model must say RAMDUMP_MSG.txt comes out complete exactly when the real extraction
 // writes a file of the size its last "Found file" line announced.
-#include <sys/stat.h>
-
-#include <string>
-
-#include "ramdump/dump_extract.h"
 #include "tests/fuzz/fuzz_common.h"
 #include "tools/ramdump_inspect/dump_stream.h"
 
@@ -30,20 +25,13 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (size < 3) return 0;
-  const std::string stream(reinterpret_cast<const char*>(data) + 3, size - 3);
-  std::string readout;
-  device_extraction device;
-  device_extraction_init(&device);
-  for (size_t at = 0; at < stream.size(); at += UNIT_PAYLOAD_SIZE) {
-    std::string unit = "BCho" + std::string(12, '\0') + stream.substr(at, UNIT_PAYLOAD_SIZE);
-    if ((data[0] & 1) != 0) unit.resize(UNIT_SIZE, '\0');
-    if (unit.size() == UNIT_SIZE)
-      device_extraction_feed(&device, reinterpret_cast<const uint8_t*>(unit.data()));
-    readout += unit;
-  }
   reset_dump_filter_state_for_test();
   found = false;
-  fuzz_extract(readout, base_dir);
+  const std::string readout = fuzz_extract(data + 3, size - 3, (data[0] & 1) != 0, base_dir);
+  device_extraction device;
+  device_extraction_init(&device);
+  for (size_t at = 0; at + UNIT_SIZE <= readout.size(); at += UNIT_SIZE)
+    device_extraction_feed(&device, reinterpret_cast<const uint8_t*>(readout.data() + at));
   struct stat st;
   if (device.message_complete != (found && stat(message.c_str(), &st) == 0 &&
                                   static_cast<unsigned long long>(st.st_size) == found_size))

@@ -7,7 +7,6 @@
 #include <filesystem>
 #include <fstream>
 #include <iterator>
-#include <string>
 #include <vector>
 
 extern "C" int LLVMFuzzerInitialize(int* argc, char*** argv);
@@ -16,9 +15,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
 int main(int argc, char** argv) {
   LLVMFuzzerInitialize(&argc, &argv);
   size_t replayed = 0;
+  std::error_code missing;
   for (int i = 1; i < argc; ++i) {
-    if (!std::filesystem::is_directory(argv[i])) continue;
-    for (const auto& entry : std::filesystem::directory_iterator(argv[i])) {
+    for (const auto& entry : std::filesystem::directory_iterator(argv[i], missing)) {
       std::ifstream in(entry.path(), std::ios::binary);
       const std::vector<uint8_t> bytes{std::istreambuf_iterator<char>(in), {}};
       fprintf(stderr, "%s (%zu bytes)\n", entry.path().c_str(), bytes.size());
