@@ -1,8 +1,9 @@
 #!/usr/bin/env bash
 # Runs the device tests of the tool's main paths with every program they start in the fake
 # device root under valgrind's memcheck (RB_TEST_WRAPPER): creation and arming, read-out and
-# integrity test, the boot entry and its request file, the read-out of a stored dump with its
-# message, and a mount table merged from the device tree and a file. An invalid access, or a
+# integrity test, the fault table's rows without a fault (the boot entry and its request file,
+# the read-out of a stored dump with its message and the re-arming, the boot that disables the
+# feature), and a mount table merged from the device tree and a file. An invalid access, or a
 # leak other than the memory the tool keeps on purpose (tests/fault/valgrind.supp), makes the
 # program exit with status 99, which fails its test. Installs valgrind when missing and first
 # builds the plain build directory given (default: build). Run as root.
@@ -17,7 +18,7 @@ fi
 install_missing valgrind
 start=$SECONDS
 cmake --build "$build_dir" -j"$(nproc)" \
-  --target block_io_test boot_cycle_test fstab_default_test >/dev/null
+  --target block_io_test fault_injection_test fstab_default_test >/dev/null
 # Inside the root, memcheck reads the suppressions from descriptor 4 and reports to descriptor
 # 3, both inherited from here.
 export RB_TEST_WRAPPER=/usr/bin/valgrind
@@ -35,7 +36,7 @@ run() {
 status=0
 {
   run block_io_test 'Arming.*' &&
-    run boot_cycle_test 'BootEntry.*:AutoCycle.StateWordAndReadOutOfASmallChain' &&
+    run fault_injection_test 'FaultInjection.EveryCase' &&
     run fstab_default_test 'DefaultFstab.TableChoiceAndDeviceTree'
 } 3>&2 4<tests/fault/valgrind.supp || status=1
 echo "valgrind: $((SECONDS - start)) s, $([ $status -eq 0 ] && echo "no errors" || echo FAILED)"

@@ -1,8 +1,8 @@
 // Fault injection for tests/fault, preloaded (LD_PRELOAD): RB_FAULT=RULE[,RULE...] makes calls
 // fail or come up short, RULE = CALL[.TARGET]=ACTION with
-//   CALL    read, write, lseek (lseek64), fopen, flock, fibmap (the FIBMAP ioctl)
-//   TARGET  dev: a block device; data: a regular file under /data; misc: a path ending in
-//           "/misc" (fopen); none: every call
+//   CALL    read, write, lseek (lseek64), fopen, openat, flock, fibmap (the FIBMAP ioctl)
+//   TARGET  dev: a block device; data: a regular file under /data (fopen, openat: a path that
+//           begins with "/data/"); misc: a path ending in "/misc"; none: every call
 //   ACTION  ERR%n: matching calls 1, n+1, 2n+1... fail with ERR; ERR#k: the k-th one fails;
 //           ERR+k: the k-th and every later one; ERR@b (fibmap): the mapping of logical block b
 //           fails, leaving b in place; short (write): half of what was asked is written
@@ -14,6 +14,7 @@
 #define _GNU_SOURCE
 #include <dlfcn.h>
 #include <errno.h>
+#include <fcntl.h>
 #include <stdarg.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -42,7 +43,7 @@ static int parse_rule(const char* text, struct rule* r) {
   }
   snprintf(call, sizeof(call), "|%s|", r->call);
   snprintf(target, sizeof(target), "|%s|", r->target);
-  if (!strstr("|read|write|lseek|fopen|flock|fibmap|", call) ||
+  if (!strstr("|read|write|lseek|fopen|openat|flock|fibmap|", call) ||
       !strstr("||dev|data|misc|", target)) {
     return 0;
   }
@@ -79,6 +80,7 @@ static int is_target(const char* target, int fd, const char* path) {
   size_t len = path != NULL ? strlen(path) : 0;
   if (target[0] == '\0') return 1;
   if (strcmp(target, "misc") == 0) return len >= 5 && strcmp(path + len - 5, "/misc") == 0;
+  if (path != NULL) return strcmp(target, "data") == 0 && strncmp(path, "/data/", 6) == 0;
   if (fd < 0 || fstat(fd, &st) != 0) return 0;
   if (strcmp(target, "dev") == 0) return S_ISBLK(st.st_mode);
   snprintf(link, sizeof(link), "/proc/self/fd/%d", fd);
@@ -101,19 +103,14 @@ static struct rule* fault(const char* call, int fd, const char* path, long block
   return hit;
 }
 
-static int fail(int error) {
-  errno = error;
-  return -1;
-}
-
 ssize_t read(int fd, void* buf, size_t count) {
   struct rule* r = fault("read", fd, NULL, -1);
-  return r != NULL ? fail(r->error) : REAL(read)(fd, buf, count);
+  return r != NULL ? (errno = r->error, -1) : REAL(read)(fd, buf, count);
 }
 
 ssize_t write(int fd, const void* buf, size_t count) {
   struct rule* r = fault("write", fd, NULL, -1);
-  if (r != NULL && r->kind != 's') return fail(r->error);
+  if (r != NULL && r->kind != 's') return (errno = r->error, -1);
   const char* trace = getenv("RB_FAULT_TRACE");
   const int traced = trace != NULL && is_target("dev", fd, NULL);
   const off64_t at = traced ? REAL(lseek64)(fd, 0, SEEK_CUR) : 0;
@@ -128,7 +125,7 @@ ssize_t write(int fd, const void* buf, size_t count) {
 
 off64_t lseek64(int fd, off64_t offset, int whence) {
   struct rule* r = fault("lseek", fd, NULL, -1);
-  return r != NULL ? fail(r->error) : REAL(lseek64)(fd, offset, whence);
+  return r != NULL ? (errno = r->error, -1) : REAL(lseek64)(fd, offset, whence);
 }
 
 FILE* fopen(const char* path, const char* mode) {
@@ -137,9 +134,18 @@ FILE* fopen(const char* path, const char* mode) {
   return r != NULL ? NULL : REAL(fopen)(path, mode);
 }
 
+int openat(int dir, const char* path, int flags, ...) {
+  va_list ap;
+  va_start(ap, flags);
+  mode_t mode = (flags & O_CREAT) != 0 || (flags & O_TMPFILE) == O_TMPFILE ? va_arg(ap, mode_t) : 0;
+  va_end(ap);
+  struct rule* r = fault("openat", -1, path, -1);
+  return r != NULL ? (errno = r->error, -1) : REAL(openat)(dir, path, flags, mode);
+}
+
 int flock(int fd, int operation) {
   struct rule* r = fault("flock", fd, NULL, -1);
-  return r != NULL ? fail(r->error) : REAL(flock)(fd, operation);
+  return r != NULL ? (errno = r->error, -1) : REAL(flock)(fd, operation);
 }
 
 int ioctl(int fd, unsigned long request, ...) {
@@ -149,5 +155,5 @@ int ioctl(int fd, unsigned long request, ...) {
   va_end(ap);
   struct rule* r =
       request == 1 /* FIBMAP */ && arg != NULL ? fault("fibmap", fd, NULL, *arg) : NULL;
-  return r != NULL ? fail(r->error) : REAL(ioctl)(fd, request, arg);
+  return r != NULL ? (errno = r->error, -1) : REAL(ioctl)(fd, request, arg);
 }
