@@ -324,11 +324,9 @@ std::vector<Case> cases() {
        fs::remove_all(d.host_path(kApq)), relink(d, reserved, 5, reserved[2]), space(kKeep)(d);
      }, [](FakeDevice& d) {
        EXPECT_EQ(d.read_file(kMessage), kMsgText);
-       EXPECT_EQ(d.read_file(kOutput).size(), kCount * 4096);
        EXPECT_EQ(verify_chain(d, reserved, kCrc, true), "");
-       for (const std::string& dir : {kApq, kOutDir}) {
-         EXPECT_EQ(fs::status(d.host_path(dir)).permissions(), fs::perms::all) << dir;
-       }
+       // Made here; apq/00 is made anew by every read-out, where another mode would show.
+       EXPECT_EQ(fs::status(d.host_path(kApq)).permissions(), fs::perms::all);
      }, kReserved},
     {"enable full, whatever the request; hostile record names: only the message file written", "",
      {"enable", "full"}, 0, "", {I("Found file 'RAMDUMP_MSG.txt', size 6")},
