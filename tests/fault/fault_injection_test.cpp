@@ -218,6 +218,8 @@ std::vector<Case> cases() {
      "read.dev=EINTR%2,lseek.dev=EINTR%2", {"-r", kOut, kArmed}, 0, zeros,
      {I("Opened " USERDATA_DEVICE " for reading"), I("Success")}, {kOut}, nullptr,
      read_up_to(kArmedCount)},
+    {"EIO on a run's read: the run is read again block by block", "read.dev=EIO#1",
+     {"-r", kOut, kArmed}, 0, zeros, {I("Success")}, {kOut}, nullptr, read_up_to(kArmedCount)},
     {"short and interrupted writes: creation and arming go on",
      "write.data=EINTR%2,write.data=short,write.dev=short", {"-i", "77", "-c", "300000", kNew}, 0,
      std::nullopt, {I("Success")}, {kNew}, nullptr, [](FakeDevice& d) {
