@@ -167,6 +167,12 @@ TEST(HostilePaths, RunsTakeTurnsAndNothingOutsideTheToolsFilesChanges) {
     if (args[0] == "-c") f.d.remove(kReserved);
     EXPECT_EQ(held(args, [] {}).status, 0) << args[0];
   }
+  // A file of that name in another directory is not the reserved file: it does not wait.
+  int dir = open(f.d.host_path(kDir).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  EXPECT_EQ(flock(dir, LOCK_EX), 0);
+  EXPECT_EQ(
+      f.d.run({"-c", "65536", "/data/elsewhere/RAMDUMP_RESERVED"}, "reserveblocks", 20).status, 0);
+  close(dir);
   // A waiting run keeps the directory it opened. When no output can be made there (its apq is
   // immutable), the message is not sought by name: a FIFO waits at that name meanwhile.
   ASSERT_NO_FATAL_FAILURE(f.prepare());
