@@ -17,8 +17,9 @@ const std::string kDir = "/data/vendor/ramdump/";
 
 size_t longest_run(const std::vector<long>& blocks) {
   size_t longest = 1;
-  for (size_t i = 1, run = 1; i < blocks.size(); ++i, longest = std::max(longest, run)) {
+  for (size_t i = 1, run = 1; i < blocks.size(); ++i) {
     run = blocks[i] == blocks[i - 1] + 1 ? run + 1 : 1;
+    longest = std::max(longest, run);
   }
   return longest;
 }
