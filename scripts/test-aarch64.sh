@@ -264,7 +264,7 @@ check_bp_sources() {
   fi
 }
 check_bp_sources reserveblocks ramdump/*.cpp misc/*.cpp fs_mgr/*.cpp platform/*.cpp
-check_bp_sources ramdump_inspect tools/ramdump_inspect/*.cpp tools/chain_walk.cpp \
+check_bp_sources ramdump_inspect tools/dump_reader/*.cpp tools/chain_walk.cpp \
   ramdump/chain_format.cpp misc/misc_store.cpp
 
 # Left out: the full-size crash cycle (x86-64 only, see above), and the fault cases, which start

@@ -3,7 +3,7 @@
 // units, the model must say RAMDUMP_MSG.txt comes out complete exactly when the real extraction
 // writes a file of the size its last "Found file" line announced.
 #include "tests/fuzz/fuzz_common.h"
-#include "tools/ramdump_inspect/dump_stream.h"
+#include "tools/dump_reader/dump_stream.h"
 
 namespace {
 

@@ -9,9 +9,9 @@
 
 #include <string>
 
-#include "tools/ramdump_inspect/cli.h"
-#include "tools/ramdump_inspect/commands.h"
-#include "tools/ramdump_inspect/readout_reader.h"
+#include "tools/dump_reader/cli.h"
+#include "tools/dump_reader/commands.h"
+#include "tools/dump_reader/readout_reader.h"
 
 namespace {
 

@@ -14,8 +14,8 @@
 
 #include "ramdump/chain_format.h"
 #include "tools/chain_walk.h"
-#include "tools/ramdump_inspect/cli.h"
-#include "tools/ramdump_inspect/commands.h"
+#include "tools/dump_reader/cli.h"
+#include "tools/dump_reader/commands.h"
 
 namespace {
 

@@ -1,4 +1,4 @@
-#include "tools/ramdump_inspect/readout_reader.h"
+#include "tools/dump_reader/readout_reader.h"
 
 #include <errno.h>
 #include <fcntl.h>

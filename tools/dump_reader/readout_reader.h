@@ -8,8 +8,8 @@
 
 #include <string>
 
-#include "tools/ramdump_inspect/cli.h"
-#include "tools/ramdump_inspect/dump_stream.h"
+#include "tools/dump_reader/cli.h"
+#include "tools/dump_reader/dump_stream.h"
 
 // Units per read: large enough that system calls cost nothing next to the copying, small enough
 // to stay in the cache while they are parsed.

@@ -2,8 +2,8 @@
 #include <stdio.h>
 #include <string.h>
 
-#include "tools/ramdump_inspect/cli.h"
-#include "tools/ramdump_inspect/commands.h"
+#include "tools/dump_reader/cli.h"
+#include "tools/dump_reader/commands.h"
 
 namespace {
 

@@ -1,9 +1,9 @@
-#include "tools/ramdump_inspect/dump_stream.h"
+#include "tools/dump_reader/dump_stream.h"
 
 #include <string.h>
 
 #include "ramdump/le_bytes.h"
-#include "tools/ramdump_inspect/cli.h"
+#include "tools/dump_reader/cli.h"
 
 namespace {
 

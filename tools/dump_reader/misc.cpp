@@ -13,8 +13,8 @@
 #include "ramdump/le_bytes.h"
 #include "ramdump/ramdump_names.h"
 #include "tools/chain_walk.h"
-#include "tools/ramdump_inspect/cli.h"
-#include "tools/ramdump_inspect/commands.h"
+#include "tools/dump_reader/cli.h"
+#include "tools/dump_reader/commands.h"
 
 namespace {
 

@@ -1,4 +1,4 @@
-#include "tools/ramdump_inspect/cli.h"
+#include "tools/dump_reader/cli.h"
 
 #include <errno.h>
 #include <fcntl.h>

@@ -13,10 +13,10 @@
 #include <string>
 #include <vector>
 
-#include "tools/ramdump_inspect/cli.h"
-#include "tools/ramdump_inspect/commands.h"
-#include "tools/ramdump_inspect/dump_stream.h"
-#include "tools/ramdump_inspect/readout_reader.h"
+#include "tools/dump_reader/cli.h"
+#include "tools/dump_reader/commands.h"
+#include "tools/dump_reader/dump_stream.h"
+#include "tools/dump_reader/readout_reader.h"
 
 namespace {
 
