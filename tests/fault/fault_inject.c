@@ -9,8 +9,8 @@
 //   ERR     EINTR, EIO, ENOSPC, EINVAL or ENOENT
 // A rule that cannot be read ends the program with status 120, and every fault applied is
 // reported on standard error, so that no test passes because its fault did not apply. With
-// RB_FAULT_TRACE naming a file, every write that reaches a block device is appended to it as
-// "offset length".
+// RB_FAULT_TRACE naming a file, every read and write that reaches a block device is appended to
+// it as "r offset length" or "w offset length".
 #define _GNU_SOURCE
 #include <dlfcn.h>
 #include <errno.h>
@@ -103,24 +103,34 @@ static struct rule* fault(const char* call, int fd, const char* path, long block
   return hit;
 }
 
+// Where a transfer on a block device starts, or -1 when transfers are not traced.
+static off64_t trace_start(int fd) {
+  return getenv("RB_FAULT_TRACE") != NULL && is_target("dev", fd, NULL)
+             ? REAL(lseek64)(fd, 0, SEEK_CUR)
+             : -1;
+}
+
+static ssize_t trace(char kind, off64_t at, ssize_t n) {
+  FILE* f;
+  if (at >= 0 && n > 0 && (f = REAL(fopen)(getenv("RB_FAULT_TRACE"), "a")) != NULL) {
+    fprintf(f, "%c %lld %zd\n", kind, (long long)at, n);
+    fclose(f);
+  }
+  return n;
+}
+
 ssize_t read(int fd, void* buf, size_t count) {
   struct rule* r = fault("read", fd, NULL, -1);
-  return r != NULL ? (errno = r->error, -1) : REAL(read)(fd, buf, count);
+  if (r != NULL) return (errno = r->error, -1);
+  const off64_t at = trace_start(fd);
+  return trace('r', at, REAL(read)(fd, buf, count));
 }
 
 ssize_t write(int fd, const void* buf, size_t count) {
   struct rule* r = fault("write", fd, NULL, -1);
   if (r != NULL && r->kind != 's') return (errno = r->error, -1);
-  const char* trace = getenv("RB_FAULT_TRACE");
-  const int traced = trace != NULL && is_target("dev", fd, NULL);
-  const off64_t at = traced ? REAL(lseek64)(fd, 0, SEEK_CUR) : 0;
-  const ssize_t n = REAL(write)(fd, buf, r != NULL && count > 1 ? count / 2 : count);
-  FILE* f;
-  if (traced && n > 0 && (f = REAL(fopen)(trace, "a")) != NULL) {
-    fprintf(f, "%lld %zd\n", (long long)at, n);
-    fclose(f);
-  }
-  return n;
+  const off64_t at = trace_start(fd);
+  return trace('w', at, REAL(write)(fd, buf, r != NULL && count > 1 ? count / 2 : count));
 }
 
 off64_t lseek64(int fd, off64_t offset, int whence) {

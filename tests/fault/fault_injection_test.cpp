@@ -108,9 +108,19 @@ Paths changed(const Snapshot& before, const Snapshot& after) {
   return paths;
 }
 
+// The traced transfers of a block device of one kind ('r', 'w') as "offset length" lines.
+std::string traced(const FakeDevice& device, char kind) {
+  std::istringstream in(device.read_file(kTrace));
+  std::string lines;
+  for (std::string line; std::getline(in, line);) {
+    if (line[0] == kind) lines += line.substr(2) + "\n";
+  }
+  return lines;
+}
+
 // The first raw write outside the file's blocks ("none" if it has none), or "".
 std::string raw_writes(const FakeDevice& device, const std::string& file) {
-  const std::string text = device.read_file(kTrace);
+  const std::string text = traced(device, 'w');
   if (!file.empty() && text.empty()) return "none";
   const std::vector<long> blocks =
       file.empty() ? std::vector<long>()
@@ -214,10 +224,14 @@ std::vector<Case> cases() {
   };
   // clang-format off
   return {
-    {"EINTR on reads and seeks of the device: read-out unchanged",
+    {"EINTR on reads and seeks of the device: read-out unchanged, each run read at once",
      "read.dev=EINTR%2,lseek.dev=EINTR%2", {"-r", kOut, kArmed}, 0, zeros,
      {I("Opened " USERDATA_DEVICE " for reading"), I("Success")}, {kOut}, nullptr,
-     read_up_to(kArmedCount)},
+     [=](FakeDevice& d) {
+       read_up_to(kArmedCount)(d);
+       EXPECT_EQ(traced(d, 'r'), std::to_string(armed[0] * 4096) + " 4194304\n" +
+                                     std::to_string(armed[1024] * 4096) + " 311296\n");
+     }},
     {"EIO on a run's read: the run is read again block by block", "read.dev=EIO#1",
      {"-r", kOut, kArmed}, 0, zeros, {I("Success")}, {kOut}, nullptr, read_up_to(kArmedCount)},
     {"short and interrupted writes: creation and arming go on",
@@ -236,6 +250,8 @@ std::vector<Case> cases() {
      }, kArmed},
     {"the file cannot be opened once measured: no arming", "openat.data=ENOENT#1", {kArmed}, 255,
      "", {E("failed to open fd for reading: No such file or directory")}, {}},
+    {"the same for a read-out: nothing written", "openat.data=ENOENT#1", {"-r", kOut, kArmed}, 255,
+     "", {E("failed to open infile:" + kArmed + " for reading: No such file or directory")}, {}},
     {"FIBMAP fails for logical block 0: arming refuses block 0", "fibmap=EINVAL@0", {kArmed}, 255,
      "", {E("refusing to write to block 0")}, {}},
     {"FIBMAP fails for logical block 0: the integrity test reads nothing", "fibmap=EINVAL@0",
