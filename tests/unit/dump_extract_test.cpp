@@ -60,29 +60,6 @@ class DumpExtract : public testing::Test {
   std::string dir_;
 };
 
-// `first` bytes of a record header end the second payload, `second` bytes of the next end the
-// third: the carry comes from the end of the unit as read, so only splits up to 16 come whole.
-// The second unit starts inside content, so that a carry left in place shows.
-TEST_F(DumpExtract, RecordHeadersAcrossUnits) {
-  const std::string msg = pattern(5000, 3);
-  struct {
-    size_t first, second;
-    bool whole;
-  } cases[] = {{0, 0, true},   {1, 16, true},  {16, 1, true},
-               {17, 0, false}, {0, 17, false}, {9, 39, false}};
-  for (const auto& c : cases) {
-    SCOPED_TRACE(testing::Message() << "split " << c.first << "/" << c.second);
-    const std::string stream = record("PMIC", pattern(2 * kPayload - c.first - 40, 1)) +
-                               record("KLOG", pattern(kPayload + c.first - c.second - 40, 2)) +
-                               record("RAMDUMP_MSG.txt", msg) + record("FW", "fw");
-    std::string message;
-    EXPECT_EQ(extract(readout_units(stream), &message), "");
-    EXPECT_EQ(message, c.whole ? msg : "(none)");
-    const bool zero = contains(logged, "E * bad magic, got 00000000, expecting 654c3146\n");
-    EXPECT_TRUE(contains(logged, "E * bad magic, got ") && zero == c.whole) << logged;
-  }
-}
-
 TEST_F(DumpExtract, Endings) {
   const std::string msg = pattern(6000, 7),
                     two_units = readout_units(record("RAMDUMP_MSG.txt", msg));
