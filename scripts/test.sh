@@ -44,8 +44,8 @@ bash scripts/valgrind.sh build || status=1
 bash scripts/test-aarch64.sh || status=1
 # The SELinux policy compiled for user and userdebug builds, and Android.bp through bpfmt.
 bash scripts/check-android.sh || status=1
-run_ctest build-asan -E FullSize || status=1
-run_ctest build -E FullSize || status=1
+run_ctest build-asan -j"$(nproc)" -E FullSize || status=1
+run_ctest build -j"$(nproc)" -E FullSize || status=1
 
 # CTest's summary lines, the plain build's last.
 echo
