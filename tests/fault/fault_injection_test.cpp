@@ -252,8 +252,6 @@ std::vector<Case> cases() {
      "", {E("failed to open fd for reading: No such file or directory")}, {}},
     {"the same for a read-out: nothing written", "openat.data=ENOENT#1", {"-r", kOut, kArmed}, 255,
      "", {E("failed to open infile:" + kArmed + " for reading: No such file or directory")}, {}},
-    {"FIBMAP fails for logical block 0: arming refuses block 0", "fibmap=EINVAL@0", {kArmed}, 255,
-     "", {E("refusing to write to block 0")}, {}},
     {"FIBMAP fails for logical block 0: the integrity test reads nothing", "fibmap=EINVAL@0",
      {"-t", kArmed}, 0, "", {E("Failed to get block 0 for file " + kArmed + ": Invalid argument"),
       I(" block size: 4096 bytes"), I("Opened " USERDATA_DEVICE " for reading"),
