@@ -86,7 +86,7 @@ TEST(Arming, ContiguousAndFragmentedFiles) {
   auto offset_of = [&](size_t i) { return static_cast<uint64_t>(blocks[i]) * 4096; };
   // Each header differs (its CRC), so a read-out in any order but the logical one shows.
   ASSERT_EQ(device.run({"-r", kDir + "out", path}).status, 0) << device.log();
-  EXPECT_TRUE(device.read_file(kDir + "out") == raw_blocks(device, blocks));
+  EXPECT_TRUE(device.read_file(kDir + "out") == raw_blocks(device.data_device(), blocks));
 
   // The integrity test wins over -r: good; two CRCs damaged (the first reported, exit 0); a bad
   // magic (254). Returns the log after the lookup.
@@ -102,7 +102,7 @@ TEST(Arming, ContiguousAndFragmentedFiles) {
   char mismatch[128], bad_magic[96];
   snprintf(mismatch, sizeof(mismatch),
            "E reserveblocks: CRC32 mismatch at block %lx, got 04030201, expecting %08x\\n\n",
-           blocks[5], le32_at(device.read_raw(offset_of(5), 16), 12));
+           blocks[5], le32_at(raw_blocks(device.data_device(), {blocks[5]}, 16), 12));
   snprintf(bad_magic, sizeof(bad_magic),
            "E reserveblocks: Bad magic at block %lx, got 6f684358\\n\n", blocks[9]);
   EXPECT_EQ(walk(0), walked);
@@ -141,19 +141,19 @@ TEST(Conversion, RefusedFilesAndLookupFailures) {
   };
   for (const auto& c : cases) {
     const std::string file = c.args.empty() ? "" : c.args[0];
-    const std::string before = raw_blocks(device, map_file(device, file, 8));
+    const std::string before = raw_blocks(device.data_device(), map_file(device, file, 8));
     device.clear_log();
     RunResult r = device.run(c.args);
     EXPECT_EQ(r.status, c.status) << file;
     EXPECT_EQ(r.out, "") << file;
     EXPECT_EQ(r.err.rfind("usage: ", 0) == 0, c.args.empty()) << r.err;  // no operand: usage
     EXPECT_TRUE(contains(tool_log(device), "E reserveblocks: " + c.log)) << device.log();
-    EXPECT_TRUE(raw_blocks(device, map_file(device, file, 8)) == before) << file;
+    EXPECT_TRUE(raw_blocks(device.data_device(), map_file(device, file, 8)) == before) << file;
   }
   // The read-out copies device block 0 in place of a hole.
   ASSERT_EQ(device.run({"-r", kDir + "holey.out", holey}).status, 0) << device.log();
   const std::string copied = device.read_file(kDir + "holey.out");
-  EXPECT_TRUE(copied == raw_blocks(device, holey_blocks));
+  EXPECT_TRUE(copied == raw_blocks(device.data_device(), holey_blocks));
   EXPECT_EQ(copied.substr(0, 4096), std::string(4096, 'h'));
 }
 

@@ -33,15 +33,6 @@ std::string device_name(dev_t dev) {
   return std::to_string(major(dev)) + ":" + std::to_string(minor(dev));
 }
 
-// The first `size` bytes of each block.
-std::string raw_at(const std::string& device, const std::vector<long>& blocks, size_t size = 4096) {
-  std::string bytes(blocks.size() * size, '\0');
-  int fd = open(device.c_str(), O_RDONLY | O_CLOEXEC);
-  for (size_t i = 0; i < blocks.size(); ++i) pread(fd, &bytes[i * size], size, blocks[i] * 4096);
-  close(fd);
-  return bytes;
-}
-
 void shell(const std::string& command) { ASSERT_EQ(system(command.c_str()), 0) << command; }
 
 // /data with a victim file and an empty directory, a second ext4 file system at /mnt with a
@@ -98,7 +89,8 @@ struct Fixture {
   // Every byte that no run may change.
   std::string untouchable() const {
     return d.read_file("/data/victim") + d.read_file("/mnt/victim") +
-           raw_at(d.data_device(), victim) + raw_at(d.data_device(), mnt) + raw_at(other, reserved);
+           raw_blocks(d.data_device(), victim) + raw_blocks(d.data_device(), mnt) +
+           raw_blocks(other, reserved);
   }
 
   void set_fstab(const std::string& device) {
@@ -243,7 +235,7 @@ TEST(HostilePaths, RunsTakeTurnsAndNothingOutsideTheToolsFilesChanges) {
   for (const auto& row : rows) {
     SCOPED_TRACE("row " + std::to_string(&row - rows));
     ASSERT_NO_FATAL_FAILURE(f.prepare());
-    const std::string before = f.untouchable(), dump = raw_at(f.d.data_device(), f.reserved);
+    const std::string before = f.untouchable(), dump = raw_blocks(f.d.data_device(), f.reserved);
     row.plant();
     r = f.d.run(row.args, "reserveblocks", 20);
     EXPECT_EQ(r.status, row.status) << f.d.log();
@@ -260,7 +252,7 @@ TEST(HostilePaths, RunsTakeTurnsAndNothingOutsideTheToolsFilesChanges) {
                 !f.d.exists("/data/absent"));
     if (row.args == boot) {
       EXPECT_EQ(f.d.property("debug.kvo.kvdump"), row.status == 0 ? "done" : "fail");
-      EXPECT_TRUE(row.log != not_held || (raw_at(f.d.data_device(), f.reserved) == dump &&
+      EXPECT_TRUE(row.log != not_held || (raw_blocks(f.d.data_device(), f.reserved) == dump &&
                                           !f.d.exists(kOutDir + "/RAMDUMP_OUTPUT")));
     }
   }
@@ -276,7 +268,7 @@ TEST(HostilePaths, RunsTakeTurnsAndNothingOutsideTheToolsFilesChanges) {
   f.d.write_file(slaves + "loopx/dev", device_name(st.st_rdev) + "\n");
   f.set_fstab(kOther);
   EXPECT_EQ(f.d.run({"-i", "5eed", kReserved}).status, 0) << f.d.log();
-  EXPECT_TRUE(raw_at(f.other, f.reserved, 16) == raw_at(f.d.data_device(), f.reserved, 16));
+  EXPECT_TRUE(raw_blocks(f.other, f.reserved, 16) == raw_blocks(f.d.data_device(), f.reserved, 16));
   f.d.write_file(slaves + "loopy/dev", device_name(st.st_rdev) + "\n");  // two slaves
   EXPECT_EQ(f.d.run({"-t", kReserved}).status, 255);
 }

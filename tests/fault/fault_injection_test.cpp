@@ -197,7 +197,7 @@ std::vector<Case> cases() {
               deleted = with(boot, {kOutput, kMessage, kOutDir, kApq});
   const auto read_up_to = [](size_t n) -> Step {  // the read-out holds kArmed's first n blocks
     return [n](FakeDevice& d) {
-      EXPECT_EQ(d.read_file(kOut), raw_blocks(d, {armed.begin(), armed.begin() + n}));
+      EXPECT_EQ(d.read_file(kOut), raw_blocks(d.data_device(), {armed.begin(), armed.begin() + n}));
     };
   };
   const auto space = [](uint64_t free) -> Step {

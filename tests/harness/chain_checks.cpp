@@ -69,9 +69,11 @@ std::string verify_chain(const FakeDevice& device, const std::vector<long>& bloc
   return problem;
 }
 
-std::string raw_blocks(const FakeDevice& device, const std::vector<long>& blocks) {
-  std::string bytes;
-  for (long block : blocks) bytes += device.read_raw(static_cast<uint64_t>(block) * 4096, 4096);
+std::string raw_blocks(const std::string& raw, const std::vector<long>& blocks, size_t size) {
+  std::string bytes(blocks.size() * size, '\0');
+  int fd = open(raw.c_str(), O_RDONLY | O_CLOEXEC);
+  for (size_t i = 0; i < blocks.size(); ++i) pread(fd, &bytes[i * size], size, blocks[i] * 4096);
+  close(fd);
   return bytes;
 }
 

@@ -19,8 +19,8 @@ std::vector<long> map_file(const FakeDevice& device, const std::string& path, ui
 std::string verify_chain(const FakeDevice& device, const std::vector<long>& blocks,
                          uint32_t initial_crc, bool payload_zero);
 
-// The blocks' bytes on the raw device, in the order given.
-std::string raw_blocks(const FakeDevice& device, const std::vector<long>& blocks);
+// The first size bytes of each block on a raw device (host node), in the order given.
+std::string raw_blocks(const std::string& raw, const std::vector<long>& blocks, size_t size = 4096);
 // Replaces bytes of the misc image at offset.
 void set_misc_item(FakeDevice& device, size_t offset, const std::string& bytes);
 

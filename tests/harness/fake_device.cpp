@@ -225,15 +225,6 @@ RunResult FakeDevice::run_in_root(const std::function<int()>& fn, int timeout_se
   return result;
 }
 
-std::string FakeDevice::read_raw(uint64_t offset, size_t length) const {
-  std::ifstream in(loop_device_, std::ios::binary);
-  std::string bytes(length, '\0');
-  in.seekg(static_cast<std::streamoff>(offset))
-      .read(&bytes[0], static_cast<std::streamsize>(length));
-  bytes.resize(static_cast<size_t>(in.gcount()));
-  return bytes;
-}
-
 void FakeDevice::write_raw(uint64_t offset, const std::string& bytes) const {
   std::ofstream out(loop_device_, std::ios::binary | std::ios::in | std::ios::out);
   out.seekp(static_cast<std::streamoff>(offset)) << bytes;

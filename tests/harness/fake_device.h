@@ -81,7 +81,6 @@ class FakeDevice {
 
   // The raw /data device (host node).
   const std::string& data_device() const { return loop_device_; }
-  std::string read_raw(uint64_t offset, size_t length) const;
   void write_raw(uint64_t offset, const std::string& bytes) const;
 
   // Fills /data/filler until exactly this many bytes are available; false if it cannot.
