@@ -1,8 +1,10 @@
-// The host tools run as built on read-outs and images made here: ramdump_inspect and
-// firmware_sim's options.
+// Read-outs and the images around them as their readers take them: the tool's own message
+// extraction, and the host tools as built (ramdump_inspect, firmware_sim's options).
+#include <android/log.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>
+#include <string.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -18,6 +20,7 @@
 
 #include "ramdump/arming.h"
 #include "ramdump/chain_format.h"
+#include "ramdump/dump_extract.h"
 #include "tests/harness/chain_checks.h"
 
 namespace {
@@ -26,6 +29,7 @@ namespace fs = std::filesystem;
 using Files = std::map<std::string, std::string>;
 constexpr size_t P = 4080;  // payload bytes of a unit
 constexpr uint32_t kCrc = 0x5eed1234;
+constexpr char kMsg[] = "RAMDUMP_MSG.txt";
 
 std::string pattern(size_t n, unsigned seed) {
   std::string s(n, '\0');
@@ -80,7 +84,7 @@ bool holds(const std::string& path, const std::string& bytes) {
   return at == bytes.size() && in.gcount() == 0;
 }
 
-class HostTools : public testing::Test {
+class Readout : public testing::Test {
  protected:
   void TearDown() override { fs::remove_all(dir_); }
 
@@ -141,7 +145,7 @@ class HostTools : public testing::Test {
     write_at(dev_, blocks_[i] * 4096, raw), write_at(readout_, i * 4096, raw);
   }
 
-  std::string dir_ = testing::TempDir() + "host_tools_XXXXXX";
+  std::string dir_ = testing::TempDir() + "readout_XXXXXX";
   const std::string readout_ = (mkdtemp(dir_.data()), dir_ + "/RAMDUMP_OUTPUT"), x_ = dir_ + "/x",
                     dev_ = dir_ + "/dev.img", misc_ = dir_ + "/misc.img";
   std::vector<int64_t> blocks_;
@@ -152,7 +156,7 @@ class HostTools : public testing::Test {
 // Records across unit boundaries and read-outs that end badly: what list says (whether the tool
 // extracts the message whole, too; readout_stream_fuzz holds its model to the real extraction)
 // and exits with, and what extract writes.
-TEST_F(HostTools, StreamsAndEndings) {
+TEST_F(Readout, StreamsAndEndings) {
   umask(022);
   // clang-format off
   // readout: "" for the records' own; err: in list's error or detail; message: the tool writes RAMDUMP_MSG.txt whole.
@@ -220,7 +224,7 @@ TEST_F(HostTools, StreamsAndEndings) {
 
 // Usage errors, inputs and outputs that are refused, names that are not safe file names or
 // repeat, and what extract does with what is already in DIR (x) and with NAME arguments.
-TEST_F(HostTools, CommandsNamesAndTargets) {
+TEST_F(Readout, CommandsNamesAndTargets) {
   // clang-format off
   const std::string readout = readout_units(stream_of({{"memory0.bin", "new"}, {"RAMDUMP_OUTPUT", "log"}}));
   write_host_file(readout_, readout);
@@ -291,7 +295,7 @@ TEST_F(HostTools, CommandsNamesAndTargets) {
 
 // ramdump_inspect verify and misc, and firmware_sim --verify-only, on a chain and misc image
 // damaged in one place each; none of them changes either image.
-TEST_F(HostTools, VerifyMiscAndFirmwareSim) {
+TEST_F(Readout, VerifyMiscAndFirmwareSim) {
   arm();
   const std::string misc_image = read_host_file(misc_);
   // clang-format off
@@ -355,6 +359,66 @@ TEST_F(HostTools, VerifyMiscAndFirmwareSim) {
     for (const auto& [i, h] : undo_) put(i, h);
     undo_.clear(), write_host_file(misc_, misc_image);
   }
+}
+
+// The tool's extraction of read-outs that end badly: standard error, the message file ("(none)"
+// when there is none) and the log.
+TEST_F(Readout, ToolExtraction) {
+  static std::string logged;  // "<I|E> <message>" per record
+  __android_log_set_logger([](const __android_logger_data* data, const char* message) {
+    logged += std::string(data->priority == ANDROID_LOG_ERROR ? "E " : "I ") + message;
+  });
+  const std::string msg = pattern(6000, 7), two_units = readout_units(stream_of({{kMsg, msg}}));
+  const std::string damaged = two_units.substr(0, 4096) + "xV4\x12" + two_units.substr(4100);
+  const std::string filler = stream_of({{"KLOG", pattern(P - 80, 5)}});  // ends a payload
+  const std::string tail = stream_of({{kMsg, "msg"}, {"FW", pattern(P, 9)}});
+  const std::string huger = dump_record(kMsg, ~0ull, "k") + tail;
+  std::string swallowed = huger.substr(40);  // to the end of the last unit
+  swallowed.resize((huger.size() + P - 1) / P * P - 40);
+  const std::string found = "I Found file 'RAMDUMP_MSG.txt', size ";
+  struct {
+    std::string readout, err, message, log;
+  } rows[] = {
+      // A zero-length write never reports success: an empty wanted record fails once data follows.
+      {readout_units(filler + dump_record(kMsg, 0, "") + tail), "Could not write 0 bytes", "",
+       found + "0\n"},
+      {readout_units(filler + dump_record(kMsg, 0, "")), "", "", found + "0\n"},
+      {damaged, "* bad block header magic, got 12345678, expecting 6f684342\n",
+       msg.substr(0, P - 40), found + "6000\n"},
+      {two_units.substr(0, 4096 + 1000), "", msg.substr(0, P - 40),  // partial unit unread
+       found + "6000\n"},
+      // Sizes beyond the data swallow the rest, even past the signed range.
+      {readout_units(dump_record("KLOG", 1ull << 40, "k") + tail), "", "(none)", ""},
+      {readout_units(huger), "", swallowed, found + "18446744073709551615\n"},
+      {"", "Unable to open " + readout_ + " for reading\n", "(none)", ""},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(&row - rows);
+    reset_dump_filter_state_for_test();
+    logged.clear();
+    fs::remove(readout_), fs::remove(x_ + "/" + kMsg), fs::create_directories(x_);
+    if (!row.readout.empty()) write_host_file(readout_, row.readout);
+    testing::internal::CaptureStderr();
+    EXPECT_EQ(extract_ramdump_msg(readout_.c_str(), x_.c_str()), 0);
+    EXPECT_EQ(testing::internal::GetCapturedStderr(), row.err);
+    EXPECT_EQ(fs::exists(x_ + "/" + kMsg) ? read_host_file(x_ + "/" + kMsg) : "(none)",
+              row.message);
+    EXPECT_EQ(logged, row.log);
+  }
+  __android_log_set_logger(__android_log_stderr_logger);
+}
+
+// The path is built for every record; one over 4096 characters ends the process, never cut short.
+TEST(ExtractionDeathTest, OutputPathLimit) {
+  const std::string stream = dump_record("FW_DIAG", 0, ""), fits(4096 - strlen("/FW_DIAG"), 'd');
+  FILE* out = nullptr;
+  auto filter = [&](const std::string& out_dir) {
+    reset_dump_filter_state_for_test();
+    return process_data_filtered(reinterpret_cast<const uint8_t*>(stream.data()),
+                                 DUMP_FILE_RECORD_SIZE, &out, kMsg, out_dir.c_str());
+  };
+  EXPECT_EQ(filter(fits), 0);
+  EXPECT_DEATH(filter(fits + "d"), "longer than 4096 characters");
 }
 
 }  // namespace
