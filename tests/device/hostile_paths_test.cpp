@@ -99,11 +99,8 @@ struct Fixture {
   void link(const std::string& target, const std::string& path, bool hard = false) {
     d.remove(path);
     fs::create_directories(fs::path(d.host_path(path)).parent_path());
-    if (hard) {
-      fs::create_hard_link(d.host_path(target), d.host_path(path));
-    } else {
-      fs::create_symlink(target, d.host_path(path));
-    }
+    hard ? fs::create_hard_link(d.host_path(target), d.host_path(path))
+         : fs::create_symlink(target, d.host_path(path));
   }
   // A link at a name inside apq/00 that the run cannot remove: it is there when the output is
   // written, as if planted after the old output was deleted.
