@@ -244,7 +244,7 @@ fi
 
 cmake -S . -B build-aarch64 --no-warn-unused-cli \
   -DCMAKE_TOOLCHAIN_FILE=cmake/aarch64-linux-gnu.cmake \
-  -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
+  -DCMAKE_BUILD_TYPE=RelWithDebInfo -DRB_DEMO_AND_BENCHMARK=OFF >/dev/null
 cmake --build build-aarch64 -j"$(nproc)"
 
 status=0

@@ -5,14 +5,15 @@
 # (scripts/valgrind.sh), tests the aarch64 build under emulation (scripts/test-aarch64.sh),
 # checks the Android policy and build file (scripts/check-android.sh), and runs CTest on both
 # builds. The full-size crash cycle (4 GiB written and read back) runs in the plain build
-# only, alongside the fuzzers: it mostly waits for the disk, and they run for a fixed time.
+# only; it and valgrind run alongside the fuzzers: the cycle mostly waits for the disk, and the
+# fuzzers run for a fixed time.
 # Run as root: the device tests use loop devices, mount namespaces and chroot (without root
 # they are skipped).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 bash scripts/setup.sh build
-bash scripts/setup.sh build-asan -DRB_SANITIZE=ON
+bash scripts/setup.sh build-asan -DRB_SANITIZE=ON -DRB_DEMO_AND_BENCHMARK=OFF
 
 summaries=()
 run_ctest() {
@@ -29,17 +30,24 @@ run_ctest() {
   return "$rc"
 }
 
+# What valgrind.sh and fuzz.sh would install, first: two apt-get runs at once would collide.
+source scripts/install_missing.sh
+install_missing valgrind clang-14 libclang-rt-14-dev
+
 status=0
 full_size=$(mktemp)
+valgrind_log=$(mktemp)
 (cd build && ctest --output-on-failure -R FullSize) >"$full_size" 2>&1 &
 full_size_pid=$!
-# Each fuzz target for a minute in its own clang build, and the main paths under valgrind.
+# The main paths under valgrind, and each fuzz target for a minute in its own clang build.
+bash scripts/valgrind.sh build >"$valgrind_log" 2>&1 &
+valgrind_pid=$!
 bash scripts/fuzz.sh || status=1
 wait "$full_size_pid" || status=1
-cat "$full_size"
+wait "$valgrind_pid" || status=1
+cat "$full_size" "$valgrind_log"
 full_size_summary=$(grep -E 'tests passed|tests failed' "$full_size" | tail -n 1)
-rm -f "$full_size"
-bash scripts/valgrind.sh build || status=1
+rm -f "$full_size" "$valgrind_log"
 # The aarch64 build under qemu-user, and its bytes against the x86-64 build's.
 bash scripts/test-aarch64.sh || status=1
 # The SELinux policy compiled for user and userdebug builds, and Android.bp through bpfmt.
