@@ -67,6 +67,9 @@ TEST(Arming, ContiguousAndFragmentedFiles) {
   EXPECT_EQ(fs::status(device.host_path(small)).permissions(), fs::perms(0660));
   EXPECT_EQ(fs::status(device.host_path(out)).permissions(), fs::perms(0666));
   EXPECT_EQ(device.read_file(out), std::string(16 * 4096, '\xFF'));
+  // Runs over 1024 blocks, read out in pieces of 1024 (under valgrind and emulation too).
+  ASSERT_EQ(device.run({"-r", kDir + "big.out", big}).status, 0);
+  EXPECT_TRUE(device.read_file(kDir + "big.out") == raw_blocks(device.data_device(), big_blocks));
 
   // A file allocated 4 blocks at a time alternately with another one: many short runs.
   const std::string path = kDir + "armed", data(64 * 4096, '\x77');

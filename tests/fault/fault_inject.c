@@ -9,8 +9,8 @@
 //   ERR     EINTR, EIO, ENOSPC, EINVAL or ENOENT
 // A rule that cannot be read ends the program with status 120, and every fault applied is
 // reported on standard error, so that no test passes because its fault did not apply. With
-// RB_FAULT_TRACE naming a file, every read and write that reaches a block device is appended to
-// it as "r offset length" or "w offset length".
+// RB_FAULT_TRACE naming a file, every read() and write() that reaches a block device is appended
+// to it as "r offset length" or "w offset length" (offset -1 when it cannot be told).
 #define _GNU_SOURCE
 #include <dlfcn.h>
 #include <errno.h>
@@ -103,16 +103,18 @@ static struct rule* fault(const char* call, int fd, const char* path, long block
   return hit;
 }
 
-// Where a transfer on a block device starts, or -1 when transfers are not traced.
+#define UNTRACED (-2)
+
+// Where a transfer on a block device starts, or UNTRACED.
 static off64_t trace_start(int fd) {
   return getenv("RB_FAULT_TRACE") != NULL && is_target("dev", fd, NULL)
              ? REAL(lseek64)(fd, 0, SEEK_CUR)
-             : -1;
+             : UNTRACED;
 }
 
 static ssize_t trace(char kind, off64_t at, ssize_t n) {
   FILE* f;
-  if (at >= 0 && n > 0 && (f = REAL(fopen)(getenv("RB_FAULT_TRACE"), "a")) != NULL) {
+  if (at != UNTRACED && n > 0 && (f = REAL(fopen)(getenv("RB_FAULT_TRACE"), "a")) != NULL) {
     fprintf(f, "%c %lld %zd\n", kind, (long long)at, n);
     fclose(f);
   }

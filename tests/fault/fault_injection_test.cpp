@@ -1,5 +1,6 @@
 // Failing system calls (fault_inject.c, preloaded), hostile on-disk data and the boot-time runs
-// of the real binaries in the fake device root: status, output, log, every change, raw writes.
+// of the real binaries in the fake device root: status, output, log, every change, raw reads and
+// writes.
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
@@ -252,6 +253,8 @@ std::vector<Case> cases() {
      "", {E("failed to open fd for reading: No such file or directory")}, {}},
     {"the same for a read-out: nothing written", "openat.data=ENOENT#1", {"-r", kOut, kArmed}, 255,
      "", {E("failed to open infile:" + kArmed + " for reading: No such file or directory")}, {}},
+    {"FIBMAP fails for logical block 0: arming refuses block 0", "fibmap=EINVAL@0", {kArmed}, 255,
+     "", {E("refusing to write to block 0")}, {}},
     {"FIBMAP fails for logical block 0: the integrity test reads nothing", "fibmap=EINVAL@0",
      {"-t", kArmed}, 0, "", {E("Failed to get block 0 for file " + kArmed + ": Invalid argument"),
       I(" block size: 4096 bytes"), I("Opened " USERDATA_DEVICE " for reading"),
@@ -333,7 +336,8 @@ std::vector<Case> cases() {
     {"EIO reading the device at boot: the read-out fails, the chain is re-armed", "read.dev=EIO+1",
      {"-a"}, 255, "",
      {E("error reading: Input/output error"), E("Failed to read out ramdump from reserved blocks")},
-     with(boot, {kIbh, kOutput, kMessage}), nullptr, nullptr, kReserved},
+     with(boot, {kIbh, kOutput, kMessage}), nullptr,
+     [](FakeDevice& d) { EXPECT_EQ(verify_chain(d, reserved, kCrc, true), ""); }, kReserved},
     {"the lock cannot be taken at boot", "flock=EINVAL+1", {"-a"}, 255, "", {lock}, {kKvdump}},
     {"the same for enable full: its status stays 0", "flock=EINVAL+1", {"enable", "full"}, 0, "",
      {lock}, {kKvdump}},

@@ -19,7 +19,8 @@ std::vector<long> map_file(const FakeDevice& device, const std::string& path, ui
 std::string verify_chain(const FakeDevice& device, const std::vector<long>& blocks,
                          uint32_t initial_crc, bool payload_zero);
 
-// The first size bytes of each block on a raw device (host node), in the order given.
+// The first size bytes of each block on a raw device (host node), in the order given; zeros for
+// an unmapped block (-1).
 std::string raw_blocks(const std::string& raw, const std::vector<long>& blocks, size_t size = 4096);
 // Replaces bytes of the misc image at offset.
 void set_misc_item(FakeDevice& device, size_t offset, const std::string& bytes);

@@ -181,6 +181,14 @@ TEST_F(Readout, StreamsAndEndings) {
        4080, "bad_chain_magic", 1, false},
       {{{"memory0.bin", pattern(P - 60, 8)}}, readout_units(head), "inside a record header at stream offset 4060",
        4060, "cut_header", 1, false}});
+  // firmware_sim's filler record puts the next record's header 1 byte before a unit's end.
+  const std::string m(5000, 'm');
+  write_host_file(dir_ + "/memory0.bin", m);
+  arm();
+  ASSERT_EQ(run("firmware_sim --first-record-at 4079 " + misc_ + " " + dev_ + " " + dir_ + "/memory0.bin").status, 0);
+  rows.push_back({{{"filler.bin", std::string(4039, '\0')}, {"memory0.bin", m}}, raw_blocks(dev_, blocks_), "", 4079 + 5040,
+                  "bad_magic", 0, false});
+  EXPECT_EQ(le32_at(read_host_file(misc_), 3184 + 20), STATE_ARMED | STATE_DUMP_PRESENT);
   // clang-format on
   for (const Row& row : rows) {
     SCOPED_TRACE(row.err + " " + std::to_string(row.end));
@@ -357,6 +365,14 @@ TEST_F(Readout, ToolExtraction) {
   std::string swallowed = huger.substr(40);  // to the end of the last unit
   swallowed.resize((huger.size() + P - 1) / P * P - 40);
   const std::string found = "I Found file 'RAMDUMP_MSG.txt', size ";
+  // Two record headers split at the ends of two payloads in a row, f and s bytes before them.
+  const auto splits = [&](size_t f, size_t s) {
+    return readout_units(stream_of({{"PMIC", pattern(2 * P - f - 40, 1)},
+                                    {"KLOG", pattern(P + f - s - 40, 2)},
+                                    {kMsg, msg},
+                                    {"FW", ""}}));
+  };
+  const std::string zeros = "E * bad magic, got 00000000, expecting 654c3146\n";
   struct {
     std::string readout, err, message, log;
   } rows[] = {
@@ -372,6 +388,9 @@ TEST_F(Readout, ToolExtraction) {
       {readout_units(dump_record("KLOG", 1ull << 40, "k") + tail), "", "(none)", ""},
       {readout_units(huger), "", swallowed, found + "18446744073709551615\n"},
       {"", "Unable to open " + readout_ + " for reading\n", "(none)", ""},
+      // A carry of up to 16 bytes comes whole, also where the unit it starts ends in another.
+      {splits(1, 16), "", msg, found + "6000\n" + zeros},
+      {splits(16, 1), "", msg, found + "6000\n" + zeros},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(&row - rows);
