@@ -1,42 +1,14 @@
 #include "ramdump/chain_format.h"
 
 #include <gtest/gtest.h>
-#include <stdio.h>
 #include <unistd.h>
 
 #include <string>
 #include <thread>
-#include <vector>
 
-#include "ramdump/arming.h"
 #include "ramdump/retry_io.h"
 
 namespace {
-
-// Arms a chain with the arming's own writer into a sparse file standing in for the raw device
-// and returns every chain block's 16-byte header as read back.
-std::vector<std::string> arm(const std::vector<int64_t>& blocks, uint32_t initial_crc) {
-  FILE* device = tmpfile();
-  std::vector<uint8_t> buffer(MAX_RUN_BLOCKS * 4096, 0);
-  write_chain(fileno(device), blocks.data(), static_cast<uint32_t>(blocks.size()), buffer.data(),
-              4096, initial_crc, 0);
-  std::vector<std::string> headers;
-  for (int64_t b : blocks) {
-    headers.emplace_back(16, '\0');
-    EXPECT_EQ(pread(fileno(device), &headers.back()[0], 16, b * 4096), 16) << b;
-  }
-  fclose(device);
-  return headers;
-}
-
-// A run of two blocks, then one elsewhere: the headers as the firmware expects them.
-TEST(ChainWriter, KnownChain) {
-  using namespace std::string_literals;
-  EXPECT_EQ(arm({0x1000, 0x1001, 0x2000}, 0x12345678),
-            (std::vector<std::string>{"BCho\x01\x10\0\0\0\0\x02\0\x43\x50\x1D\x1C"s,
-                                      "BCho\0\x20\0\0\0\0\x01\0\xA6\x42\x84\x68"s,
-                                      "BCho\0\0\0\0\0\0\x01\0\xEC\x06\x4A\x39"s}));
-}
 
 // Exact bytes, then the decoded bytes encoded again: every field comes back only if the decoder
 // reads it at its offset.
