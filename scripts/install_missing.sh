@@ -8,7 +8,11 @@ install_missing() {
   if [ ${#missing[@]} -gt 0 ]; then
     echo "installing: ${missing[*]}"
     export DEBIAN_FRONTEND=noninteractive
-    apt-get update -qq
-    apt-get install -y -qq "${missing[@]}" >/dev/null
+    # Scripts that run at once take turns: two apt-get runs would collide on dpkg's lock.
+    (
+      flock 9
+      apt-get update -qq
+      apt-get install -y -qq "${missing[@]}" >/dev/null
+    ) 9>/tmp/rb-install-missing.lock
   fi
 }

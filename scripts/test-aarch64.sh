@@ -268,8 +268,8 @@ check_bp_sources ramdump_inspect tools/dump_reader/*.cpp tools/chain_walk.cpp \
   ramdump/chain_format.cpp misc/misc_store.cpp
 
 # Left out: the full-size crash cycle (x86-64 only, see above), and the fault table: under a
-# wrapper it runs only its rows without a fault, which valgrind runs on x86-64, and the boot
-# cycle of the comparison below runs the aarch64 tool through the same paths.
+# wrapper it runs only its rows without a fault, which valgrind runs on x86-64; the aarch64
+# tool's boot cycle is the comparison's below.
 echo "--- CTest, aarch64 programs under $QEMU"
 (cd build-aarch64 &&
   RB_TEST_WRAPPER=$QEMU ctest --output-on-failure -E 'FullSize|FaultInjection') ||

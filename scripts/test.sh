@@ -12,7 +12,7 @@
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
-bash scripts/setup.sh build
+bash scripts/setup.sh build -DRB_DEMO_AND_BENCHMARK=ON
 bash scripts/setup.sh build-asan -DRB_SANITIZE=ON -DRB_DEMO_AND_BENCHMARK=OFF
 
 summaries=()
@@ -25,19 +25,15 @@ run_ctest() {
   (cd "$dir" && ctest --output-on-failure "$@") 2>&1 | tee "$log"
   local rc=${PIPESTATUS[0]}
   set -e
-  summaries+=("$(grep -E 'tests passed|tests failed' "$log" | tail -n 1)")
+  summaries+=("$(grep -E 'tests passed|tests failed' "$log" | tail -n 1 || true)")
   rm -f "$log"
   return "$rc"
 }
 
-# What valgrind.sh and fuzz.sh would install, first: two apt-get runs at once would collide.
-source scripts/install_missing.sh
-install_missing valgrind clang-14 libclang-rt-14-dev
-
 status=0
 full_size=$(mktemp)
 valgrind_log=$(mktemp)
-(cd build && ctest --output-on-failure -R FullSize) >"$full_size" 2>&1 &
+(cd build && ctest --output-on-failure --no-tests=error -R FullSize) >"$full_size" 2>&1 &
 full_size_pid=$!
 # The main paths under valgrind, and each fuzz target for a minute in its own clang build.
 bash scripts/valgrind.sh build >"$valgrind_log" 2>&1 &
@@ -46,7 +42,7 @@ bash scripts/fuzz.sh || status=1
 wait "$full_size_pid" || status=1
 wait "$valgrind_pid" || status=1
 cat "$full_size" "$valgrind_log"
-full_size_summary=$(grep -E 'tests passed|tests failed' "$full_size" | tail -n 1)
+full_size_summary=$(grep -E 'tests passed|tests failed' "$full_size" | tail -n 1 || true)
 rm -f "$full_size" "$valgrind_log"
 # The aarch64 build under qemu-user, and its bytes against the x86-64 build's.
 bash scripts/test-aarch64.sh || status=1
