@@ -44,13 +44,7 @@ struct Fixture {
 
   void set_up() {
     // The same geometry as /data, so that the reserved file's blocks are data blocks there too.
-    const std::string image = "/tmp/rb-other." + std::to_string(getpid()), at = d.host_path("/mnt");
-    shell("truncate -s 16G " + image + " && mkfs.ext4 -q -F -m 0 -b 4096 " + image + " && mkdir " +
-          at + " && mount -o loop,noatime " + image + " " + at + " && rm " + image);
-    struct stat st;
-    ASSERT_EQ(stat(at.c_str(), &st), 0);
-    other = "/dev/loop" + std::to_string(minor(st.st_dev));
-    ASSERT_EQ(mknod(d.host_path(kOther).c_str(), S_IFBLK | 0600, st.st_dev), 0);
+    other = d.mount_ext4(16ull << 30, "/mnt", kOther);
     d.write_file("/data/victim", std::string(kCount * 4096, 'V'), 0600);
     victim = map_file(d, "/data/victim", kCount);
     d.write_file("/mnt/before", std::string(kCount * 4096, 'W'));  // other blocks than victim's

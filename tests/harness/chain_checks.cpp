@@ -76,8 +76,11 @@ std::string raw_blocks(const std::string& raw, const std::vector<long>& blocks, 
   int fd = open(raw.c_str(), O_RDONLY | O_CLOEXEC);
   for (size_t i = 0; i < blocks.size(); ++i) {
     // Thrown, so that two failed reads never compare equal (a test reports it as its failure).
-    if (blocks[i] >= 0 && pread(fd, &bytes[i * size], size, blocks[i] * 4096) != ssize_t(size))
-      throw std::runtime_error("cannot read " + raw + ": " + strerror(errno));
+    if (blocks[i] >= 0 && pread(fd, &bytes[i * size], size, blocks[i] * 4096) != ssize_t(size)) {
+      const std::string why = strerror(errno);
+      close(fd);
+      throw std::runtime_error("cannot read " + raw + ": " + why);
+    }
   }
   close(fd);
   return bytes;

@@ -105,25 +105,30 @@ void FakeDevice::setup(const FakeDeviceConfig& config) {
   }
   write_file("/vendor/etc/fstab.rbtest", config.fstab);
   if (config.data_bytes != 0) {
-    const std::string image = work_ + "/data.img";
-    write_host_file(image, "");
-    fs::resize_file(image, config.data_bytes);
-    // No blocks reserved for root, so that free space is what statvfs reports as available.
-    const std::string mkfs = "mkfs.ext4 -q -F -m 0 -b 4096 " + config.mkfs_options + " " + image;
-    if (system((mkfs + " >/dev/null 2>&1").c_str()) != 0) throw std::runtime_error(mkfs);
-    // mount(8) attaches a loop device that detaches itself once unmounted; the image is
-    // removed at once, so that nothing is left behind if we are killed.
-    const std::string data = host_path("/data");
-    if (system(("mount -o loop " + image + " " + data + " && rm " + image).c_str()) != 0) {
-      throw std::runtime_error("mount ext4 on a loop device");
-    }
-    struct stat st;
-    check(stat(data.c_str(), &st) == 0, "stat /data");
-    loop_device_ = "/dev/loop" + std::to_string(minor(st.st_dev));
-    check(mknod(host_path(USERDATA_DEVICE).c_str(), S_IFBLK | 0600, st.st_dev) == 0,
-          "userdata node");
+    loop_device_ = mount_ext4(config.data_bytes, "/data", USERDATA_DEVICE, config.mkfs_options);
   }
   fs::create_directories(host_path("/data/vendor/ramdump"));
+}
+
+std::string FakeDevice::mount_ext4(uint64_t bytes, const std::string& mount_point,
+                                   const std::string& node, const std::string& mkfs_options) {
+  const std::string image = work_ + "/" + fs::path(mount_point).filename().string() + ".img",
+                    dir = host_path(mount_point);
+  fs::create_directories(dir);
+  write_host_file(image, "");
+  fs::resize_file(image, bytes);
+  // No blocks reserved for root, so that free space is what statvfs reports as available.
+  const std::string mkfs = "mkfs.ext4 -q -F -m 0 -b 4096 " + mkfs_options + " " + image;
+  if (system((mkfs + " >/dev/null 2>&1").c_str()) != 0) throw std::runtime_error(mkfs);
+  // mount(8) attaches a loop device that detaches itself once unmounted; the image is removed
+  // at once, so that nothing is left behind if we are killed.
+  if (system(("mount -o loop,noatime " + image + " " + dir + " && rm " + image).c_str()) != 0) {
+    throw std::runtime_error("mount ext4 on a loop device at " + mount_point);
+  }
+  struct stat st;
+  check(stat(dir.c_str(), &st) == 0, "stat " + mount_point);
+  check(mknod(host_path(node).c_str(), S_IFBLK | 0600, st.st_dev) == 0, "node " + node);
+  return "/dev/loop" + std::to_string(minor(st.st_dev));
 }
 
 void FakeDevice::teardown() {

@@ -79,6 +79,11 @@ class FakeDevice {
   std::string misc_host_path() const { return host_path(MISC_DEVICE); }
   std::string misc_bytes() const { return read_file(MISC_DEVICE); }
 
+  // Mounts a new sparse ext4 file system of `bytes` at mount_point on a loop device and makes
+  // the device's node at node (both in the root); returns its host node. Throws when it cannot.
+  std::string mount_ext4(uint64_t bytes, const std::string& mount_point, const std::string& node,
+                         const std::string& mkfs_options = "");
+
   // The raw /data device (host node).
   const std::string& data_device() const { return loop_device_; }
   void write_raw(uint64_t offset, const std::string& bytes) const;
